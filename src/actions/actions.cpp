@@ -1,0 +1,5 @@
+#include "actions/actions.h"
+
+void LogEvent(SLHandle*, EventRecord*)
+{
+}

@@ -1,0 +1,185 @@
+#include "daemon/events.h"
+
+#include <atomic>
+#include <cstring>
+#include <ctime>
+#include <pthread.h>
+
+#include "actions/actions.h"
+#include "actions/strcase.h"
+#include "events/eventrecord.h"
+#include "events/oldevent.h"
+#include "events/stdevent.h"
+#include "hardware/lcd.h"
+#include "hardware/sysctrl.h"
+#include "mif/mif.h"
+#include "sl/slaccess.h"
+#include "sl/slhandle.h"
+
+namespace {
+
+std::atomic<int> eventThreadRunning{0};
+std::atomic<int> threadId{0}; // 1 while the worker is inside its loop
+std::atomic<unsigned> numberOfEvents{0};
+
+// The queue owns the handles on it; the worker is its only remover.
+SLHandleListHead slHandleList;
+
+const char* const zorekEventClassName = "Zorek|Error";
+const char* const stdEventClassName = "EventGeneration|";
+
+void unknownEventActions(SLHandle* handle)
+{
+    EventRecord record{};
+    record.eventKind = EVENT_UNKNOWN;
+    record.componentId = SLEventComponentId(handle, 0);
+    record.componentName = ComponentName(record.componentId);
+    LogEvent(handle, &record);
+}
+
+void installActions(SLHandle* handle)
+{
+    uint32_t id = SLComponentId(handle);
+    AddComponentToList(SLComponentName(handle), id);
+    SysCtrlInitialize();
+    LcdInitialize();
+}
+
+// Set before the worker starts; read by the worker only.
+EventCallees callees = eventsDefaultCallees();
+
+void sleepOneSecond()
+{
+    timespec second{1, 0};
+    nanosleep(&second, nullptr);
+}
+
+// The class string's first 16 characters, read whatever its length word says
+// (the class test is a prefix test), but never past the end of the indication.
+void classPrefix(SLHandle* handle, const DmiString* classString, char (&prefix)[17])
+{
+    std::memset(prefix, 0, sizeof prefix);
+    const char* text = dmiStringText(classString);
+    uint32_t limit = handle->confirmSize;
+    uint32_t stated = loadWordAt(handle->command, 2);
+    if (SLIndicationType(handle) < 256 && stated < limit)
+        limit = stated;
+    const char* end = reinterpret_cast<const char*>(handle->confirm) + limit;
+    size_t available = text < end ? static_cast<size_t>(end - text) : 0;
+    std::memcpy(prefix, text, available < 16 ? available : 16);
+}
+
+void eventActions(SLHandle* handle)
+{
+    if (SLEventClassCount(handle) == 0)
+        return;
+    const DmiString* classString = SLEventClassString(handle, 0);
+    if (classString == nullptr)
+        return;
+    char prefix[17];
+    classPrefix(handle, classString, prefix);
+    const EventCallees& calls = callees;
+    if (strnicmp(prefix, zorekEventClassName, 11) == 0)
+        calls.vendor(handle);
+    else if (strnicmp(prefix, stdEventClassName, 16) == 0)
+        calls.standard(handle);
+    else
+        calls.unknown(handle);
+}
+
+void* eventHandlerThread(void*)
+{
+    threadId = 1;
+    while (eventThreadRunning == 1) {
+        SLHandle* handle = SLHeadHandle(slHandleList.get());
+        if (handle == nullptr) {
+            sleepOneSecond();
+            continue;
+        }
+        processEvent(handle);
+        SLDestroyHandle(handle);
+    }
+    threadId = 0;
+    return nullptr;
+}
+
+} // namespace
+
+EventCallees eventsDefaultCallees()
+{
+    return EventCallees{StdEventActions, ZorekEventActions, unknownEventActions, installActions};
+}
+
+EventCallees eventsSetCallees(const EventCallees& replacement)
+{
+    EventCallees previous = callees;
+    callees = replacement;
+    return previous;
+}
+
+void processEvent(SLHandle* handle)
+{
+    ++numberOfEvents;
+    switch (SLIndicationType(handle)) {
+    case 1:
+        eventActions(handle);
+        break;
+    case 2:
+        callees.installed(handle);
+        break;
+    case 3:
+        // An uninstalled component stays in the catalogue.
+        SLComponentId(handle);
+        break;
+    default:
+        break;
+    }
+}
+
+int EventHandler(SLHandle* handle)
+{
+    if (eventThreadRunning == 0)
+        return 0;
+    SLHandle* copy = SLDupHandle(handle);
+    if (copy == nullptr)
+        return 0;
+    SLUnlinkHandle(copy);
+    SLEnqueueHandle(slHandleList.get(), copy);
+    return 0;
+}
+
+int CreateEventHandler(void)
+{
+    slInitHandleList(slHandleList.get());
+    eventThreadRunning = 1;
+    pthread_attr_t attributes;
+    pthread_attr_init(&attributes);
+    pthread_attr_setdetachstate(&attributes, PTHREAD_CREATE_DETACHED);
+    pthread_t thread;
+    int rc = pthread_create(&thread, &attributes, eventHandlerThread, nullptr);
+    pthread_attr_destroy(&attributes);
+    return rc;
+}
+
+void KillEventThread(void)
+{
+    eventThreadRunning = 0;
+    while (threadId == 1)
+        sleepOneSecond();
+}
+
+int DestroyEventHandler(void)
+{
+    KillEventThread();
+    return SLDestroyAllHandles(slHandleList.get());
+}
+
+unsigned EventsHandled(void)
+{
+    return numberOfEvents;
+}
+
+unsigned eventsQueued()
+{
+    return slHandleListLength(slHandleList.get());
+}

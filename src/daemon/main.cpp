@@ -1,0 +1,6 @@
+#include "daemon/startup.h"
+
+int main()
+{
+    moxMain();
+}

@@ -1,0 +1,162 @@
+#include "daemon/startup.h"
+
+#include <csignal>
+#include <cstdlib>
+#include <cstring>
+#include <fcntl.h>
+#include <pthread.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include "actions/uxaction.h"
+#include "base/log.h"
+#include "daemon/daemon.h"
+#include "daemon/events.h"
+#include "mif/mif.h"
+#include "sl/sl.h"
+
+namespace {
+
+// Each marker-check message goes to standard output, then to the system log.
+void tell(const MarkerCheck& check, const char* text, const char* logText = nullptr)
+{
+    fputs(text, check.out);
+    fflush(check.out);
+    moxLog(LOG_ERR, "%s", logText != nullptr ? logText : text);
+}
+
+bool readable(const char* path)
+{
+    int fd = open(path, O_RDONLY);
+    if (fd < 0)
+        return false;
+    close(fd);
+    return true;
+}
+
+bool fopenable(const char* path)
+{
+    FILE* file = fopen(path, "r");
+    if (file == nullptr)
+        return false;
+    fclose(file);
+    return true;
+}
+
+} // namespace
+
+MarkerCheck defaultMarkerCheck()
+{
+    return MarkerCheck{"./vornmox.not",
+                       "./mox.not",
+                       "/mnt/floppy/mox.not",
+                       "/mnt/floppy/vornmox.not",
+                       "mount -t msdos /dev/fd0 /mnt/floppy 2>/dev/null",
+                       "umount /mnt/floppy 2>/dev/null",
+                       system,
+                       stdout};
+}
+
+int checkForMoxNot(const MarkerCheck& check)
+{
+    // In the working directory vornmox.not comes first; on the floppy mox.not.
+    if (readable(check.localVornmox) || readable(check.localMox))
+        return 4;
+    tell(check, "Checking for mox configurations ..\n", "\nChecking for mox configurations ..\n");
+    if (check.run(check.mountCommand) != 0) {
+        tell(check, "There is no floppy found in floppy drive\n");
+        tell(check, "Proceeding with loading mox ..\n");
+        return 0;
+    }
+    if (fopenable(check.floppyMox)) {
+        check.run(check.umountCommand);
+        tell(check, "file mox.not  found in floppy\n");
+        return 4;
+    }
+    if (fopenable(check.floppyVornmox)) {
+        check.run(check.umountCommand);
+        tell(check, "file vornmox.not found in floppy\n");
+        return 4;
+    }
+    tell(check, "Couldn't find any mox configuration files in floppy drive\n");
+    tell(check, "Proceeding with loading mox ..\n");
+    check.run(check.umountCommand);
+    return 0;
+}
+
+int check_for_moxnot(void)
+{
+    return checkForMoxNot(defaultMarkerCheck());
+}
+
+int init_routine(void)
+{
+    MoxOsSpecificInit();
+    ProcessCfgOption();
+    SLInitialize();
+    int rc = RegisterWithSL();
+    if (rc == 0)
+        CreateEventHandler();
+    return rc;
+}
+
+int unload(void)
+{
+    DestroyEventHandler();
+    return SLCleanup();
+}
+
+void* mainThread(void*)
+{
+    char message[124];
+    memset(message, 0, sizeof message);
+    pthread_t signalThread;
+    bool signalThreadRuns = daemon_startSignalHandling(nullptr, nullptr, &signalThread) == 0;
+    if (!signalThreadRuns)
+        moxLog(LOG_INFO, "MOX Could  not install signalhandler \n");
+
+    int rc = init_routine();
+    if (rc != 0) {
+        snprintf(message, sizeof message, "mox: initialization failed, return code = 0x%x", rc);
+        moxLog(LOG_ERR, "%s\n", message);
+        printf("MOX ERROR, %s\n", message);
+        fflush(stdout);
+        exit(1);
+    }
+    if (signalThreadRuns) {
+        pthread_join(signalThread, nullptr);
+    } else {
+        // No signal thread: wait for the termination signals on this thread.
+        sigset_t wait;
+        if (daemon_defaultWaitSet(&wait) == 0)
+            pthread_sigmask(SIG_SETMASK, &wait, nullptr);
+        signalHandlerThread(daemon_signalParam());
+    }
+    return nullptr;
+}
+
+void moxMain()
+{
+    // Lines reach a supervisor that captures standard output as they are written.
+    setvbuf(stdout, nullptr, _IOLBF, 0);
+    if (check_for_moxnot() == 4) {
+        printf("Mox has been disabled.\n");
+        moxLog(LOG_ERR, "%s", "Mox has been disabled.\n");
+        exit(0);
+    }
+    // Signals sent to the process must reach only the signal thread's sigwait:
+    // block them here too, or the kernel delivers them to this thread.
+    sigset_t wait;
+    if (daemon_defaultWaitSet(&wait) == 0)
+        pthread_sigmask(SIG_SETMASK, &wait, nullptr);
+
+    pthread_t thread;
+    int error = pthread_create(&thread, nullptr, mainThread, nullptr);
+    if (error != 0) {
+        moxLog(LOG_ERR, "mox: cannot start the main thread: %s\n", strerror(error));
+        exit(1);
+    }
+    sleep(10);
+    pthread_join(thread, nullptr);
+    exit(0);
+}

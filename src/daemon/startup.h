@@ -1,0 +1,27 @@
+// Process entry: marker files, the start-up sequence and the stop.
+#pragma once
+
+#include <cstdio>
+
+// The process entry's work; never returns.
+[[noreturn]] void moxMain();
+// 4: a marker file disables the daemon; 0: start-up proceeds.
+int check_for_moxnot(void);
+void* mainThread(void* unused);
+// 0, or the non-zero result of RegisterWithSL.
+int init_routine(void);
+int unload(void);
+
+// Where the marker check looks and how it runs the floppy commands.
+struct MarkerCheck {
+    const char* localVornmox;
+    const char* localMox;
+    const char* floppyMox;
+    const char* floppyVornmox;
+    const char* mountCommand;
+    const char* umountCommand;
+    int (*run)(const char* command); // system() in the daemon
+    FILE* out;                       // standard output in the daemon
+};
+MarkerCheck defaultMarkerCheck();
+int checkForMoxNot(const MarkerCheck& check);

@@ -1,0 +1,5 @@
+#include "events/oldevent.h"
+
+void ZorekEventActions(SLHandle*)
+{
+}

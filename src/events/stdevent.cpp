@@ -1,0 +1,5 @@
+#include "events/stdevent.h"
+
+void StdEventActions(SLHandle*)
+{
+}

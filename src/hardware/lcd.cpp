@@ -1,0 +1,6 @@
+#include "hardware/lcd.h"
+
+int LcdInitialize(void)
+{
+    return -1;
+}

@@ -1,0 +1,5 @@
+// The baseboard's front-panel status display.
+#pragma once
+
+// 0 when the status-display group is known, -1 otherwise.
+int LcdInitialize(void);

@@ -1,0 +1,6 @@
+#include "hardware/sysctrl.h"
+
+int SysCtrlInitialize(void)
+{
+    return -1;
+}
