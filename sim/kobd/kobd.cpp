@@ -85,7 +85,10 @@ int main(int argc, char** argv)
                 printf("kobd: short record of %zd bytes\n", got);
                 continue;
             }
-            printf("alarm type=%u component=%u group=%u eventGroup=%u severity=%u instance=%u power=%u\n",
+            printf("alarm ");
+            for (unsigned char byte : record)
+                printf("%02x", byte);
+            printf(" type=%u component=%u group=%u eventGroup=%u severity=%u instance=%u power=%u\n",
                    record[0], word(record + 4), word(record + 8), word(record + 12), word(record + 16),
                    word(record + 20), record[24]);
             fflush(stdout);

@@ -1,5 +1,7 @@
 #include "events/stdevent.h"
 
+#include <initializer_list>
+
 #include "actions/actions.h"
 #include "daemon/alert.h"
 #include "mif/mif.h"
