@@ -17,6 +17,7 @@
 #include "sl/slaccess.h"
 #include "sl/slhandle.h"
 #include "sl/slstring.h"
+#include "smtp/email.h"
 
 const ActionOrder ActionID[] = {
     {8, 1},  {7, 0},  {9, 2},  {10, 3}, {16, 9}, {20, 13}, {19, 12}, {21, 14},
@@ -32,8 +33,6 @@ const char* text(const char* s)
 {
     return s != nullptr ? s : absent;
 }
-
-int sendEmail(SLHandle* indication, EventRecord* record);
 
 const ActionEntry* handlers = lscActions;
 
@@ -164,7 +163,7 @@ const ActionEntry lscActions[] = {
     {16, BroadcastMessage},
     {18, issueNMI},
     {19, issuePage},
-    {20, sendEmail},
+    {20, MoxSendEmail},
     {21, MoxIdLedOff},
     {22, MoxIdLedBlink},
     {0, nullptr},
@@ -332,12 +331,3 @@ int issueNMI(SLHandle*, EventRecord*)
 {
     return systemControl(0x04, 8, 200);
 }
-
-namespace {
-
-int sendEmail(SLHandle*, EventRecord*)
-{
-    return 0;
-}
-
-} // namespace
