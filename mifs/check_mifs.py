@@ -144,6 +144,7 @@ class Attribute:
         self.id = None
         self.type = None                  # ("int", kw) ("str", n) ("date",) ("enum", Enum)
         self.access = None
+        self.storage = None
         self.value = None
         self.line = 0
 
@@ -855,7 +856,7 @@ def check(directory):
         else:
             for r in sup.rows:
                 mif, name = r[ids[0]], r[ids[1]]
-                if mif in comps or mif in (0,):
+                if mif in comps or mif == 0:
                     ck.bad("mox.mif", f"group 2: MIF id {mif} used twice or reserved")
                 if name not in by_name:
                     ck.bad("mox.mif", f"group 2: no MIF here for component {name!r}")
