@@ -104,6 +104,7 @@ protected:
             processEvent(h);
             return 0;
         });
+        settle(); // the installs above announce themselves too
         recorded.clear();
         logged.clear();
         saved_ = actionsSetHandlers(recordingTable);
@@ -120,17 +121,21 @@ protected:
         SLCleanup();
         dmisp::shutdown();
     }
-    // Raises through the provider and waits until the event's handling is
-    // over: the provider hears of the indication's completion only then.
-    Codes deliver(const std::function<uint32_t()>& raise)
+    // Waits until every indication raised so far has been handled: the
+    // provider hears of an indication's completion only then.
+    static void settle()
     {
-        unsigned before = EventsHandled();
-        EXPECT_EQ(raise(), 0u);
         EXPECT_TRUE(dmisp::waitIndicationsDelivered());
         auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
         while (dmisp::indicationsOutstanding() != 0 && std::chrono::steady_clock::now() < deadline)
             std::this_thread::sleep_for(std::chrono::milliseconds(2));
         EXPECT_EQ(dmisp::indicationsOutstanding(), 0u);
+    }
+    Codes deliver(const std::function<uint32_t()>& raise)
+    {
+        unsigned before = EventsHandled();
+        EXPECT_EQ(raise(), 0u);
+        settle();
         EXPECT_EQ(EventsHandled(), before + 1);
         std::lock_guard<std::mutex> guard(recordedLock);
         Codes got = recorded;
