@@ -371,7 +371,9 @@ uint32_t loadWord(const uint8_t* at)
     return value;
 }
 
-Outcome sendMessage(const DriverRecord& record, const uint8_t* in)
+// A controller that refuses (`refusal` non-zero) answers with that completion
+// code and does nothing.
+Outcome sendMessage(const DriverRecord& record, const uint8_t* in, uint8_t refusal)
 {
     if (in == nullptr || record.inSize < 13 || record.outBuffer == 0 || record.outSize < 1)
         return refuse(statusInvalidParameter, EINVAL);
@@ -387,7 +389,11 @@ Outcome sendMessage(const DriverRecord& record, const uint8_t* in)
     request.data.assign(in + 13, in + 13 + in[12]);
     state.requests.push_back(request);
     Outcome outcome;
-    if (request.flags == 1) {
+    if (refusal != 0) {
+        logLine("refused: netfn 0x%02x cmd 0x%02x completion code 0x%02x", request.netFunction, request.command,
+                refusal);
+        outcome.answer = {refusal};
+    } else if (request.flags == 1) {
         uint8_t sequence = ++state.asyncSequence;
         logLine("async request: netfn 0x%02x cmd 0x%02x sequence %u", request.netFunction, request.command,
                 sequence);
@@ -412,12 +418,12 @@ std::vector<uint8_t> delivered(uint32_t channel, uint8_t privilege, int session,
     return out;
 }
 
-Outcome driverAnswer(uint32_t code, const DriverRecord& record)
+Outcome driverAnswer(uint32_t code, const DriverRecord& record, uint8_t refusal)
 {
     const auto* in = static_cast<const uint8_t*>(at(record.inBuffer));
     switch (code) {
     case ioctlSendMessage:
-        return sendMessage(record, in);
+        return sendMessage(record, in, refusal);
     case ioctlGetAsyncMessage: {
         if (in == nullptr || record.inSize < 8)
             return refuse(statusInvalidParameter, EINVAL);
@@ -781,7 +787,8 @@ int obxsimIoctl(int fd, unsigned long request, void* argument)
             return -1;
         }
     }
-    Outcome outcome = driverAnswer(code, record);
+    const uint8_t refusal = faulted && applied.fault == ObxSimCompletionCode ? applied.value : 0;
+    Outcome outcome = driverAnswer(code, record, refusal);
     if (outcome.refused) {
         setStatus(record, outcome.status);
         errno = outcome.error;
