@@ -58,7 +58,8 @@ protected:
     void TearDown() override { std::system(("rm -rf " + dir).c_str()); }
 
     // Runs the probe with the preload library and the given OBXSIM_ settings.
-    ProbeRun run(std::vector<std::string> environment, std::vector<std::string> extra = {})
+    ProbeRun run(std::vector<std::string> environment, std::vector<std::string> extra = {},
+                 const char* program = OBX_PROBE)
     {
         ProbeRun result;
         std::string logPath = dir + "/obx.log";
@@ -70,7 +71,9 @@ protected:
         for (std::string& entry : environment)
             envp.push_back(entry.data());
         envp.push_back(nullptr);
-        std::vector<std::string> arguments = {OBX_PROBE, dir + "/scratch"};
+        std::vector<std::string> arguments = {program};
+        if (program == std::string(OBX_PROBE))
+            arguments.push_back(dir + "/scratch");
         arguments.insert(arguments.end(), extra.begin(), extra.end());
         std::vector<char*> argv;
         for (std::string& argument : arguments)
@@ -82,7 +85,7 @@ protected:
         posix_spawn_file_actions_addopen(&actions, 1, outputPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
         auto start = std::chrono::steady_clock::now();
         pid_t pid = 0;
-        if (posix_spawn(&pid, OBX_PROBE, &actions, nullptr, argv.data(), envp.data()) == 0)
+        if (posix_spawn(&pid, program, &actions, nullptr, argv.data(), envp.data()) == 0)
             waitpid(pid, &result.status, 0);
         result.milliseconds = static_cast<long>(
             std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() - start).count());
@@ -144,6 +147,22 @@ TEST_F(Preload, ConfiguredFaultsReachTheProgram)
     r = run({"OBXSIM_NODEV=1"});
     EXPECT_EQ(r.output, "file ok\npipe ok\nreset 1\nclass 0x00\n");
     EXPECT_TRUE(r.log.empty());
+}
+
+TEST_F(Preload, ServesThe32BitOffsetCalls)
+{
+    std::string memory(8192, '\0');
+    memory[4097] = 0x5C;
+    std::ofstream(dir + "/memory", std::ios::binary) << memory;
+    ProbeRun r = run({"OBXSIM_MEMORY=" + dir + "/memory", "OBXSIM_MEMORY_BASE=e0000"}, {"e1000"}, OBX_PROBE32);
+    ASSERT_TRUE(WIFEXITED(r.status));
+    EXPECT_EQ(WEXITSTATUS(r.status), 0);
+    EXPECT_EQ(r.output, "writable refused\nbyte 5c\nclose 0\nclose again -1\n");
+    const std::vector<std::string> expected = {
+        "open /dev/obx read-only", "mmap physical 0xe1000 length 4096", "mmap physical 0xe1000 length 4096",
+        "munmap length 4096",      "close /dev/obx",
+    };
+    EXPECT_EQ(r.log, expected);
 }
 
 } // namespace
