@@ -115,8 +115,9 @@ TEST_F(Lcd, FirstListedDisplayFormWins)
         EXPECT_EQ(value(baseboard, c.group, c.attribute == 7 ? 8 : 7), "");
         uint32_t other = c.group == 11 ? 12 : 11;
         std::string untouched;
-        if (dmisp::getValue(baseboard, other, 7, {}, &untouched) == 0)
+        if (dmisp::getValue(baseboard, other, 7, {}, &untouched) == 0) {
             EXPECT_EQ(untouched, "");
+        }
     }
 }
 
