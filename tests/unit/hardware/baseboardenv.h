@@ -47,6 +47,11 @@ protected:
         forget();
         std::string error;
         ASSERT_EQ(dmisp::reset(dir + "/db" + std::to_string(databases++), false, &error), 0) << error;
+        // The provider confirms commands to a registered management application.
+        SLHandle* h = SLCreateHandle(0);
+        ASSERT_NE(h, nullptr);
+        ASSERT_EQ(SLDmiRegisterMgmt(h, [](SLHandle*) { return 0; }), 0);
+        SLDestroyHandle(h);
     }
 
     void forget()
