@@ -35,12 +35,15 @@ struct Received {
     std::mutex mu;
     std::vector<std::vector<uint8_t>> indications;
     std::atomic<bool> complete{true};
+    std::vector<void*> kept; // indications not yet completed
 };
 inline Received& received()
 {
     static Received r;
     return r;
 }
+
+inline void complete(void* indication);
 
 inline void indicationCallback(void* indication)
 {
@@ -50,8 +53,18 @@ inline void indicationCallback(void* indication)
         std::lock_guard<std::mutex> lock(received().mu);
         received().indications.push_back(copy);
     }
+    if (!received().complete) {
+        std::lock_guard<std::mutex> lock(received().mu);
+        received().kept.push_back(indication);
+        return;
+    }
+    complete(indication);
+}
+
+inline void complete(void* indication)
+{
     uint32_t completion = loadWordAt(indication, 11);
-    if (completion != 0 && received().complete)
+    if (completion != 0)
         reinterpret_cast<void (*)(void*)>(static_cast<uintptr_t>(completion))(indication);
 }
 
