@@ -174,5 +174,8 @@ bool waitCommandsIdle(unsigned timeoutMs = 5000);
 int runControl(const std::vector<std::string>& args, std::string* out);
 // The control socket path in use ("" when not served).
 std::string controlSocketPath();
+// Sends one request to the provider serving `socketPath` and returns its
+// exit code with its output in *out; -1 when nobody listens there.
+int controlRequest(const std::string& socketPath, const std::vector<std::string>& args, std::string* out);
 
 } // namespace dmisp
