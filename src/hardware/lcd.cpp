@@ -98,7 +98,3 @@ void ReadLCD(char* buffer)
     buffer[LcdWidth] = '\0';
     SLDestroyHandle(h);
 }
-
-void WriteLCD(const char*)
-{
-}

@@ -156,15 +156,3 @@ void SysCtrlPage(void)
         writeRequest(h, baseboard, PagingGroupId, pageControlAttribute, "Page");
     SLDestroyHandle(h);
 }
-
-void SysCtrlPage(void)
-{
-}
-
-void SysCtrlIdLedOff(void)
-{
-}
-
-void SysCtrlIdLedBlink(void)
-{
-}
