@@ -238,7 +238,7 @@ TEST_F(SmtpDialogue, ClosedConnectionIsAnErrorResultNotSigpipe)
     brokenPipes = 0;
 
     Alert alert("127.0.0.1", "a@x", "b@y,c@y", "s", BODY);
-    ScriptedServer peer({say(GREETING), expect("\r\n"), say("250 hi\r\n"), resetConnection()});
+    ScriptedServer peer({say(GREETING), expect("\r\n"), say("250 hi\r\n"), hangUp()});
     Outcome out = runDialogue(alert, peer.port());
     peer.received();
 
