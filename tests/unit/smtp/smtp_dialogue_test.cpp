@@ -2,6 +2,7 @@
 
 #include <atomic>
 #include <csignal>
+#include <netdb.h>
 #include <pthread.h>
 #include <syslog.h>
 #include <thread>
@@ -173,6 +174,22 @@ TEST_F(SmtpDialogue, RefusedConnectionGivesStep3WithErrorNumber)
         EXPECT_EQ(lines[0].second, failureLine(1, 3, ECONNREFUSED, message));
     }
     close(placeholder);
+}
+
+TEST_F(SmtpDialogue, UnknownServerNameGivesStep2WithResolverCode)
+{
+    // A name under a top-level domain reserved never to exist.
+    Alert alert("mox-alerts.invalid", "a@x", "b@y", "s", BODY);
+    Outcome out = runDialogue(alert, 25);
+    EXPECT_EQ(out.result, 0);
+    std::string message = "Server name:[mox-alerts.invalid] not found...Exiting";
+    EXPECT_EQ(out.standardError, message + "\n");
+    auto lines = LogCapture::take();
+    ASSERT_EQ(lines.size(), 1u);
+    bool matched = false;
+    for (int code : {HOST_NOT_FOUND, TRY_AGAIN, NO_RECOVERY, NO_DATA})
+        matched = matched || lines[0].second == failureLine(1, 2, code, message);
+    EXPECT_TRUE(matched) << lines[0].second;
 }
 
 // A hostile or broken server ends the attempt within the reply limit, with
