@@ -191,7 +191,7 @@ TEST_F(SmtpDelivery, AlertIsAcceptedAndHeldByPostfix)
         // The held queue file, envelope and content, as postcat shows it.
         std::string etc = folder + "/etc";
         for (int i = 0; i < 50 && held.find("Instance:CPU 1") == std::string::npos; i++) {
-            held = commandOutput("for f in " + folder + "/queue/hold/*; do [ -f \"$f\" ] && postcat -c " + etc +
+            held = commandOutput("for f in " + folder + "/queue/hold/*; do [ -f \"$f\" ] && /usr/sbin/postcat -c " + etc +
                                  " -e -h -b \"$f\"; done 2>/dev/null");
             if (held.find("Instance:CPU 1") == std::string::npos)
                 usleep(100000);
