@@ -378,10 +378,10 @@ TEST_F(SmtpDialogue, WritabilityAllowanceIsSharedBySpentWaits)
     // the subject line spends none of the allowance.
     ASSERT_EQ(waitRequests.size(), 7u);
     EXPECT_EQ(waitRequests[0], 1000);
-    for (size_t i = 1; i < waitRequests.size(); i++) {
+    for (size_t i = 1; i < waitRequests.size(); i++)
         EXPECT_LE(waitRequests[i], 1000 - 100 * static_cast<int>(i)) << i;
-        EXPECT_GE(waitRequests[i], 1000 - 150 * static_cast<int>(i) - 50) << i;
-    }
+    // Had the read counted, nothing would be left for the body and QUIT.
+    EXPECT_GT(waitRequests[6], 0);
 }
 
 TEST_F(SmtpDialogue, RecipientWaitsAreBoundedThenFailTheStep)
