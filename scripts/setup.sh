@@ -3,7 +3,10 @@
 # on an x86-64 host). Installs nothing when everything is already present.
 set -euo pipefail
 
-packages=(cmake g++ g++-multilib lib32asan8 lib32ubsan1 googletest file)
+# python3-aiosmtpd and postfix: the loopback SMTP servers that the e-mail
+# delivery tests talk to (postfix is installed unconfigured, so no system mail
+# service is set up or started; the tests run a private instance).
+packages=(cmake g++ g++-multilib lib32asan8 lib32ubsan1 googletest file python3-aiosmtpd postfix)
 
 missing=()
 for p in "${packages[@]}"; do
@@ -16,5 +19,6 @@ if [ ${#missing[@]} -gt 0 ]; then
     exit 1
   fi
   apt-get update -qq
+  echo "postfix postfix/main_mailer_type select No configuration" | debconf-set-selections
   DEBIAN_FRONTEND=noninteractive apt-get install -y -qq "${missing[@]}" >/dev/null
 fi
