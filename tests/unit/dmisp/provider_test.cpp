@@ -215,4 +215,49 @@ TEST_F(Tool, WorksOnTheDatabaseWhenNoProviderRuns)
     EXPECT_NE(out.find("database\t" + dir_), std::string::npos) << out;
 }
 
+TEST_F(Tool, ListsTheShippedMifsAndRaisesAnEventFromThem)
+{
+    const std::string mifs = MOX_SOURCE_DIR "/mifs";
+    if (!std::ifstream(mifs + "/mox.mif").good() || !std::ifstream(mifs + "/baseboard.mif").good())
+        GTEST_SKIP() << "no shipped MIFs in " << mifs;
+    Client client;
+    ASSERT_EQ(client.registerApp(true), 0u);
+    std::string out;
+    for (const char* file : {"baseboard.mif", "mox.mif"})
+        ASSERT_EQ(dmictl(std::string("install ") + mifs + "/" + file, &out), 0) << out;
+    ASSERT_EQ(dmictl("list", &out), 0);
+    EXPECT_EQ(out, "1\tZorek Tessarin Baseboard\n2\tZorek Tessarin Server Manager - Mox\n");
+    takeIndications();
+    // Every event-generation group of the baseboard names its instance
+    // group by class in attribute 5; raise one event per group, with the
+    // instance group's first row.
+    unsigned raised = 0;
+    for (const dmisp::GroupInfo& g : dmisp::groups(1)) {
+        if (g.className.rfind("EventGeneration|", 0) != 0)
+            continue;
+        std::string instanceClass;
+        ASSERT_EQ(dmisp::getValue(1, g.id, 5, {}, &instanceClass), 0u) << g.name;
+        uint32_t instance = 0;
+        for (const dmisp::GroupInfo& i : dmisp::groups(1))
+            if (i.className == instanceClass)
+                instance = i.id;
+        ASSERT_NE(instance, 0u) << instanceClass;
+        std::string key = dmisp::rows(1, instance).at(0).at(0);
+        ASSERT_EQ(dmictl("event 1 " + std::to_string(g.id) + " --instance " + std::to_string(instance) + " -k " + key,
+                         &out),
+                  0)
+            << out;
+        auto events = takeIndications();
+        ASSERT_EQ(events.size(), 1u);
+        IndicationHandle h(events[0]);
+        EXPECT_EQ(text(SLEventClassString(h.h, 0)), g.className);
+        EXPECT_EQ(text(SLEventClassString(h.h, 1)), instanceClass);
+        SLEventSelectRowCnf(h.h, 1, 0);
+        EXPECT_EQ(SLRowGroupId(h.h), instance);
+        EXPECT_EQ(std::to_string(SLRowIntegerValue(h.h, 0)), key);
+        ++raised;
+    }
+    EXPECT_GE(raised, 4u);
+}
+
 } // namespace

@@ -88,7 +88,9 @@ TEST_F(Registration, CataloguesSupportedComponents)
     EXPECT_EQ(entries, 2) << "the own component and the baseboard";
 
     // Installed again while the daemon runs: a second entry, the first answers.
-    AddComponentToList(NewDmiString("Zorek Tessarin Baseboard"), 4242); // leaks one SL string: fine in a test
+    DmiString* name = NewDmiString("Zorek Tessarin Baseboard");
+    AddComponentToList(name, 4242);
+    SLDeleteString(name);
     EXPECT_EQ(GetComponentId(1), baseboard);
     ASSERT_NE(componentList->next->next, nullptr);
     EXPECT_EQ(componentList->next->next->componentId, 4242u);
@@ -193,6 +195,15 @@ TEST_F(SupportedRows, NameMustMatchExactly)
     add("Zorek Tessarin Baseboard", 905);
     EXPECT_EQ(GetMifId(905), 1u);
     EXPECT_EQ(entries(), 3u);
+}
+
+TEST_F(SupportedRows, RowWithoutNameEndsTheSearch)
+{
+    start({"1, \"Zorek Tessarin Baseboard\"", "3, unknown", "7, \"Storage Shelf\""});
+    add("Storage Shelf", 900);
+    EXPECT_EQ(entries(), 1u) << "rows behind a nameless row are not reached";
+    add("Zorek Tessarin Baseboard", 901);
+    EXPECT_EQ(GetMifId(901), 1u);
 }
 
 TEST_F(SupportedRows, EmptyTableSupportsNothing)
