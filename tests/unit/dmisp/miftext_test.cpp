@@ -1,6 +1,8 @@
 #include <gtest/gtest.h>
 
+#include <fstream>
 #include <random>
+#include <sstream>
 #include <string>
 
 #include "dmisp/miftext.h"
@@ -256,6 +258,28 @@ TEST(MifText, DamagedTextIsRefusedOrParsedButNeverCrashes)
         }
     }
     EXPECT_GT(refused, 1000);
+}
+
+TEST(MifText, ShippedMifsReadBackToTheSameContent)
+{
+    const std::string dir = MOX_SOURCE_DIR "/mifs/";
+    int found = 0;
+    for (const char* file : {"mox.mif", "baseboard.mif", "enclosure.mif", "old/mox-2.40.mif", "old/mox-2.60.mif",
+                             "old/mox-2.92.mif"}) {
+        std::ifstream in(dir + file);
+        if (!in.good())
+            continue;
+        ++found;
+        std::stringstream text;
+        text << in.rdbuf();
+        Component c, back;
+        std::string error;
+        ASSERT_TRUE(parseMif(text.str(), file, &c, &error)) << error;
+        ASSERT_TRUE(parseMif(writeMif(c), file, &back, &error)) << error;
+        EXPECT_EQ(back, c) << file;
+    }
+    if (found == 0)
+        GTEST_SKIP() << "no shipped MIFs in " << dir;
 }
 
 } // namespace
