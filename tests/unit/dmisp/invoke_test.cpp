@@ -9,7 +9,7 @@ using namespace dmisptest;
 
 namespace {
 
-class Invoke : public ProviderTest {
+class DmispInvoke : public ProviderTest {
 protected:
     void SetUp() override
     {
@@ -21,7 +21,7 @@ protected:
     Client client_;
 };
 
-TEST_F(Invoke, RegisterConfirmHoldsLevelDescriptionAndHandle)
+TEST_F(DmispInvoke, RegisterConfirmHoldsLevelDescriptionAndHandle)
 {
     Client other;
     ASSERT_EQ(other.registerApp(false), 0u);
@@ -40,7 +40,7 @@ TEST_F(Invoke, RegisterConfirmHoldsLevelDescriptionAndHandle)
     EXPECT_EQ(other.run(), static_cast<uint32_t>(dmisp::StatusNotFound));
 }
 
-TEST_F(Invoke, ComponentRecordByteForByte)
+TEST_F(DmispInvoke, ComponentRecordByteForByte)
 {
     client_.begin(512);
     client_.set(16, component_);
@@ -71,7 +71,7 @@ TEST_F(Invoke, ComponentRecordByteForByte)
     EXPECT_EQ(SLComponentFileType(client_.h(), 0), 0u);
 }
 
-TEST_F(Invoke, ListingsFollowIdOrderFiltersAndEndWithAFailure)
+TEST_F(DmispInvoke, ListingsFollowIdOrderFiltersAndEndWithAFailure)
 {
     uint32_t second = installSample();
     std::string error;
@@ -144,7 +144,7 @@ TEST_F(Invoke, ListingsFollowIdOrderFiltersAndEndWithAFailure)
     }
 }
 
-TEST_F(Invoke, GroupEntryCarriesKeyAttributesWithoutValues)
+TEST_F(DmispInvoke, GroupEntryCarriesKeyAttributesWithoutValues)
 {
     client_.begin(516);
     client_.set(16, component_);
@@ -161,7 +161,7 @@ TEST_F(Invoke, GroupEntryCarriesKeyAttributesWithoutValues)
     EXPECT_EQ(text(SLGroupClassName(client_.h(), 0)), "DMTF|Voltage Probe|001");
 }
 
-TEST_F(Invoke, AttributeEntryWithEnumerationByteForByte)
+TEST_F(DmispInvoke, AttributeEntryWithEnumerationByteForByte)
 {
     client_.begin(520);
     client_.set(16, component_);
@@ -198,7 +198,7 @@ TEST_F(Invoke, AttributeEntryWithEnumerationByteForByte)
     }
 }
 
-TEST_F(Invoke, GetAttributeConfirmByTypeAndKeys)
+TEST_F(DmispInvoke, GetAttributeConfirmByTypeAndKeys)
 {
     // Confirm words: attribute id, group id, type, value offset; value at 16.
     client_.begin(768);
@@ -248,7 +248,7 @@ TEST_F(Invoke, GetAttributeConfirmByTypeAndKeys)
     }
 }
 
-TEST_F(Invoke, SetAttributeChecksTypeSizeAndAccess)
+TEST_F(DmispInvoke, SetAttributeChecksTypeSizeAndAccess)
 {
     auto set = [&](uint32_t group, uint32_t attribute, std::vector<std::pair<uint32_t, int32_t>> keys,
                    const std::vector<uint8_t>& value) {
@@ -334,7 +334,7 @@ TEST_F(Invoke, SetAttributeChecksTypeSizeAndAccess)
     }
 }
 
-TEST_F(Invoke, RowsCarryKeysAndStartAfterTheGivenAttribute)
+TEST_F(DmispInvoke, RowsCarryKeysAndStartAfterTheGivenAttribute)
 {
     client_.begin(772);
     client_.set(16, component_);
@@ -404,7 +404,7 @@ TEST_F(Invoke, RowsCarryKeysAndStartAfterTheGivenAttribute)
     }
 }
 
-TEST_F(Invoke, MalformedBlocksFailWithoutWritingOutsideTheConfirm)
+TEST_F(DmispInvoke, MalformedBlocksFailWithoutWritingOutsideTheConfirm)
 {
     const uint32_t Malformed = dmisp::StatusMalformed;
     const struct {
@@ -448,7 +448,7 @@ TEST_F(Invoke, MalformedBlocksFailWithoutWritingOutsideTheConfirm)
     EXPECT_EQ(DmiInvoke(nullptr), dmisp::InvokeRefused);
 }
 
-TEST_F(Invoke, InstallAndUninstallCompleteBeforeDmiInvokeReturns)
+TEST_F(DmispInvoke, InstallAndUninstallCompleteBeforeDmiInvokeReturns)
 {
     std::string path = dir_ + "/board.mif";
     std::ofstream(path) << sampleMif();
@@ -490,7 +490,7 @@ TEST_F(Invoke, InstallAndUninstallCompleteBeforeDmiInvokeReturns)
     }
 }
 
-TEST_F(Invoke, FaultsBusyRefuseNoConfirmListingStatusAndDelay)
+TEST_F(DmispInvoke, FaultsBusyRefuseNoConfirmListingStatusAndDelay)
 {
     auto listNext = [&]() {
         client_.begin(514);
@@ -532,7 +532,7 @@ TEST_F(Invoke, FaultsBusyRefuseNoConfirmListingStatusAndDelay)
     EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(150));
 }
 
-TEST_F(Invoke, CommandsWithoutAnyRegistrationAreRefused)
+TEST_F(DmispInvoke, CommandsWithoutAnyRegistrationAreRefused)
 {
     client_.begin(257);
     ASSERT_EQ(client_.run(), 0u);

@@ -83,7 +83,7 @@ Start Component
 end component
 )MIF";
 
-TEST(MifText, ParsesEveryConstructOfTheGrammar)
+TEST(DmispMifText, ParsesEveryConstructOfTheGrammar)
 {
     Component c;
     std::string error;
@@ -133,7 +133,7 @@ std::string variant(const std::string& from, const std::string& to)
     return s.replace(at, from.size(), to);
 }
 
-TEST(MifText, RefusesBadFilesWithLineAndReason)
+TEST(DmispMifText, RefusesBadFilesWithLineAndReason)
 {
     const struct {
         std::string text;
@@ -185,7 +185,7 @@ TEST(MifText, RefusesBadFilesWithLineAndReason)
     }
 }
 
-TEST(MifText, WriterOutputReadsBackToTheSameContent)
+TEST(DmispMifText, WriterOutputReadsBackToTheSameContent)
 {
     Component c;
     std::string error;
@@ -207,7 +207,7 @@ TEST(MifText, WriterOutputReadsBackToTheSameContent)
     }
 }
 
-TEST(MifText, TwoTablesFromOneTemplateKeepTheirOwnRows)
+TEST(DmispMifText, TwoTablesFromOneTemplateKeepTheirOwnRows)
 {
     std::string text = R"(start component name = "t"
         start group name = "T" class = "C|T|1" key = 1
@@ -231,7 +231,7 @@ TEST(MifText, TwoTablesFromOneTemplateKeepTheirOwnRows)
 
 // Damaged variants of a good file never crash the parser or read outside
 // the text (checked under AddressSanitizer).
-TEST(MifText, DamagedTextIsRefusedOrParsedButNeverCrashes)
+TEST(DmispMifText, DamagedTextIsRefusedOrParsedButNeverCrashes)
 {
     std::mt19937 random(12345);
     const std::string good = goodMif;
@@ -260,7 +260,7 @@ TEST(MifText, DamagedTextIsRefusedOrParsedButNeverCrashes)
     EXPECT_GT(refused, 1000);
 }
 
-TEST(MifText, ShippedMifsReadBackToTheSameContent)
+TEST(DmispMifText, ShippedMifsReadBackToTheSameContent)
 {
     const std::string dir = MOX_SOURCE_DIR "/mifs/";
     int found = 0;
