@@ -194,7 +194,10 @@ TEST_F(DmispIndications, CompletionCallbackGivesTheIndicationBack)
         kept.swap(received().kept);
     }
     ASSERT_EQ(kept.size(), 1u);
-    complete(kept[0]);
+    EXPECT_FALSE(dmisp::waitIndicationsCompleted(50));
+    std::thread later([&] { complete(kept[0]); });
+    EXPECT_TRUE(dmisp::waitIndicationsCompleted());
+    later.join();
     EXPECT_EQ(dmisp::indicationsOutstanding(), 0u);
     takeIndications();
 }
