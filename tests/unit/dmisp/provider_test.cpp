@@ -117,6 +117,27 @@ TEST_F(DmispDatabase, FilesAreRewrittenOnEveryChange)
     EXPECT_FALSE(dmisp::writeFileAtomically(dir_ + "/missing/x", "new"));
 }
 
+TEST_F(DmispDatabase, StartsOnFirstUseFromTheEnvironment)
+{
+    uint32_t a = installSample();
+    dmisp::shutdown();
+    EXPECT_EQ(dmisp::databaseDirectory(), "");
+    setenv("DMISP_DB", dir_.c_str(), 1);
+    std::string socket = dir_ + "/other.sock";
+    setenv("DMISP_SOCKET", socket.c_str(), 1);
+    Client client;
+    EXPECT_EQ(client.registerApp(false), 0u); // the first DmiInvoke opens it
+    unsetenv("DMISP_DB");
+    unsetenv("DMISP_SOCKET");
+    EXPECT_EQ(dmisp::databaseDirectory(), dir_);
+    EXPECT_EQ(dmisp::controlSocketPath(), socket);
+    std::string out;
+    EXPECT_EQ(dmisp::controlRequest(socket, {"list"}, &out), 0);
+    EXPECT_EQ(out, std::to_string(a) + "\tTest Board\n");
+    dmisp::shutdown();
+    EXPECT_EQ(dmisp::controlRequest(socket, {"list"}, &out), -1) << "nobody listens once it is closed";
+}
+
 // The command-line client against a running provider, and on the
 // database alone when no provider runs.
 class DmispTool : public ProviderTest {
