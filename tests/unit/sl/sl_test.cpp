@@ -186,6 +186,31 @@ TEST(SLCommand, RegisterPlacesTheCallbacksAndKeepsTheManagementHandle)
     EXPECT_EQ(provider.word(4, 3), 0x51u);
 }
 
+TEST(SLCommand, HandlerIsInPlaceBeforeTheRegisterCommandCompletes)
+{
+    ScriptedProvider provider;
+    static std::atomic<int> handled{0};
+    handled = 0;
+    static uint8_t indication[64];
+    storeWordAt(indication, 1, 1);
+    storeWordAt(indication, 2, sizeof indication);
+    // The provider delivers an indication while the register command is
+    // still outstanding.
+    Reply registered;
+    registered.fill = [](uint8_t* confirm, uint32_t) {
+        SLIndicationFunc(indication);
+        storeWordAt(confirm, 2, 1);
+    };
+    provider.push(registered);
+    SLHandle* h = SLCreateHandle(0);
+    ASSERT_EQ(SLDmiRegisterMgmt(h, [](SLHandle*) { return ++handled; }), 0);
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
+    while (handled == 0 && std::chrono::steady_clock::now() < deadline)
+        std::this_thread::yield();
+    EXPECT_EQ(handled.load(), 1);
+    SLDmiUnregisterMgmt(h);
+}
+
 TEST(SLCommand, FailedRegistrationRemovesTheHandler)
 {
     ScriptedProvider provider;
