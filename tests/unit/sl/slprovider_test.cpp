@@ -163,6 +163,21 @@ TEST_F(SLProvider, InstallListAndMapNames)
     EXPECT_EQ(SLInstallMIF(h_, "absent.mif"), 1);
 }
 
+TEST_F(SLProvider, ShippedMifsInstallAndReportTheirVersions)
+{
+    setenv("UXDMIPATH", MOX_MIF_DIR, 1);
+    ASSERT_EQ(SLInstallMIF(h_, "baseboard.mif"), 0) << SLCnfStatus(h_);
+    ASSERT_EQ(SLInstallMIF(h_, "mox.mif"), 0) << SLCnfStatus(h_);
+    uint32_t mox = SLMapComponentNameToId("Zorek Tessarin Server Manager - Mox");
+    ASSERT_NE(mox, 0u);
+    EXPECT_NE(SLMapComponentNameToId("Zorek Tessarin Baseboard"), mox);
+    float version = 0;
+    ASSERT_EQ(SLGetInstalledMIFVersion(h_, "Zorek Tessarin Server Manager - Mox", &version), 0);
+    EXPECT_FLOAT_EQ(version, 2.93f);
+    ASSERT_EQ(SLGetInstalledMIFVersion(h_, "Zorek Tessarin Baseboard", &version), 0);
+    EXPECT_FLOAT_EQ(version, 1.0f);
+}
+
 TEST_F(SLProvider, RowsByKeysAndValuesWithKeys)
 {
     uint32_t board = install();
