@@ -125,11 +125,7 @@ protected:
     // provider hears of an indication's completion only then.
     static void settle()
     {
-        EXPECT_TRUE(dmisp::waitIndicationsDelivered());
-        auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-        while (dmisp::indicationsOutstanding() != 0 && std::chrono::steady_clock::now() < deadline)
-            std::this_thread::sleep_for(std::chrono::milliseconds(2));
-        EXPECT_EQ(dmisp::indicationsOutstanding(), 0u);
+        EXPECT_TRUE(dmisp::waitIndicationsCompleted(10000));
     }
     Codes deliver(const std::function<uint32_t()>& raise)
     {
