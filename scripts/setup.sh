@@ -6,7 +6,11 @@ set -euo pipefail
 # python3-aiosmtpd and postfix: the loopback SMTP servers that the e-mail
 # delivery tests talk to (postfix is installed unconfigured, so no system mail
 # service is set up or started; the tests run a private instance).
-packages=(cmake g++ g++-multilib lib32asan8 lib32ubsan1 googletest file python3-aiosmtpd postfix)
+# man-db, groff-base, bsdextrautils (col) and systemd (systemd-analyze): the
+# installation tests render the manual page and verify the unit; systemd is
+# only installed, never started.
+packages=(cmake g++ g++-multilib lib32asan8 lib32ubsan1 googletest file python3-aiosmtpd postfix
+          binutils man-db groff-base bsdextrautils systemd)
 
 missing=()
 for p in "${packages[@]}"; do
