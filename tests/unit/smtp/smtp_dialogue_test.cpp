@@ -16,23 +16,6 @@ const std::string GREETING = "220 mx.test ESMTP\r\n";
 // A NUL first, high bytes, a line end, then a number too late to count.
 const char GARBAGE[] = "\0\xff\xfe\x01\r\n\x80\x90junk 250\r\n";
 
-// A server that accepts everything: one "250" for HELO, MAIL and each of
-// `recipients` RCPT commands, "354" for DATA, nothing after the subject line,
-// "250" after the end of the data, "221" for QUIT.
-std::vector<ScriptStep> acceptingScript(int recipients)
-{
-    std::vector<ScriptStep> s = {say(GREETING), expect("\r\n"), say("250 mx.test\r\n"), expect("\r\n"),
-                                 say("250 2.1.0 Ok\r\n")};
-    for (int i = 0; i < recipients; i++) {
-        s.push_back(expect("\r\n"));
-        s.push_back(say("250 2.1.5 Ok\r\n"));
-    }
-    for (ScriptStep step : {expect("DATA\r\n"), say("354 End data with <CR><LF>.<CR><LF>\r\n"), expect("\r\n.\r\n"),
-                            say("250 2.0.0 Ok: queued\r\n"), expect("QUIT\r\n"), say("221 2.0.0 Bye\r\n")})
-        s.push_back(step);
-    return s;
-}
-
 const std::string BODY = "Check Fan 1 at server alpha\n"
                          "Event Type:Warning\n"
                          "Event Severity:Non-Critical\n"
