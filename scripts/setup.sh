@@ -3,7 +3,8 @@
 # on an x86-64 host). Installs nothing when everything is already present.
 set -euo pipefail
 
-packages=(cmake g++ g++-multilib lib32asan8 lib32ubsan1 googletest file)
+packages=(cmake g++ g++-multilib lib32asan8 lib32ubsan1 googletest file
+  python3 util-linux bsdutils iproute2)
 
 missing=()
 for p in "${packages[@]}"; do
