@@ -1,0 +1,554 @@
+#include "dmisp/control.h"
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <fcntl.h>
+#include <mutex>
+#include <poll.h>
+#include <pthread.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include "base/bytes.h"
+#include "dmisp/dmisp.h"
+
+namespace dmisp {
+
+namespace {
+
+constexpr uint32_t MaxArguments = 256;
+constexpr uint32_t MaxArgument = 1u << 20;
+
+std::mutex g_controlMu; // guards the fields below
+int g_listenFd = -1;
+int g_stopPipe[2] = {-1, -1};
+pthread_t g_thread;
+std::string g_path;
+
+// ---- wire helpers ------------------------------------------------------------------
+
+bool writeAll(int fd, const void* data, size_t n)
+{
+    const char* p = static_cast<const char*>(data);
+    while (n > 0) {
+        ssize_t w = ::send(fd, p, n, MSG_NOSIGNAL);
+        if (w < 0 && errno == EINTR)
+            continue;
+        if (w <= 0)
+            return false;
+        p += w;
+        n -= static_cast<size_t>(w);
+    }
+    return true;
+}
+
+bool readAll(int fd, void* data, size_t n)
+{
+    char* p = static_cast<char*>(data);
+    while (n > 0) {
+        ssize_t r = ::recv(fd, p, n, 0);
+        if (r < 0 && errno == EINTR)
+            continue;
+        if (r <= 0)
+            return false;
+        p += r;
+        n -= static_cast<size_t>(r);
+    }
+    return true;
+}
+
+bool writeWord(int fd, uint32_t v)
+{
+    uint8_t b[4];
+    storeWord(b, v);
+    return writeAll(fd, b, 4);
+}
+
+bool readWord(int fd, uint32_t* v)
+{
+    uint8_t b[4];
+    if (!readAll(fd, b, 4))
+        return false;
+    *v = loadWord(b);
+    return true;
+}
+
+bool writeText(int fd, const std::string& s)
+{
+    return writeWord(fd, static_cast<uint32_t>(s.size())) && writeAll(fd, s.data(), s.size());
+}
+
+bool readText(int fd, std::string* s)
+{
+    uint32_t n;
+    if (!readWord(fd, &n) || n > MaxArgument)
+        return false;
+    s->resize(n);
+    return n == 0 || readAll(fd, s->data(), n);
+}
+
+bool fillAddress(const std::string& path, struct sockaddr_un* a)
+{
+    std::memset(a, 0, sizeof *a);
+    a->sun_family = AF_UNIX;
+    if (path.size() >= sizeof a->sun_path)
+        return false;
+    std::memcpy(a->sun_path, path.c_str(), path.size() + 1);
+    return true;
+}
+
+void serveOne(int fd)
+{
+    struct timeval tv = {5, 0};
+    ::setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv);
+    uint32_t argc;
+    if (!readWord(fd, &argc) || argc > MaxArguments)
+        return;
+    std::vector<std::string> args(argc);
+    for (std::string& a : args)
+        if (!readText(fd, &a))
+            return;
+    std::string out;
+    int code = runControl(args, &out);
+    if (writeWord(fd, static_cast<uint32_t>(code)))
+        writeText(fd, out);
+}
+
+void* controlThread(void*)
+{
+    for (;;) {
+        struct pollfd fds[2] = {{g_listenFd, POLLIN, 0}, {g_stopPipe[0], POLLIN, 0}};
+        if (::poll(fds, 2, -1) < 0) {
+            if (errno == EINTR)
+                continue;
+            break;
+        }
+        if (fds[1].revents != 0)
+            break;
+        if (fds[0].revents & POLLIN) {
+            int fd = ::accept4(g_listenFd, nullptr, nullptr, SOCK_CLOEXEC);
+            if (fd >= 0) {
+                serveOne(fd);
+                ::close(fd);
+            }
+        }
+    }
+    return nullptr;
+}
+
+// ---- requests ------------------------------------------------------------------------
+
+struct Args {
+    std::vector<std::string> words;
+    size_t at = 0;
+    bool more() const { return at < words.size(); }
+    const std::string& next() { return words[at++]; }
+};
+
+bool parseNumber(const std::string& s, uint32_t* v)
+{
+    if (s.empty())
+        return false;
+    char* end = nullptr;
+    errno = 0;
+    unsigned long long n = std::strtoull(s.c_str(), &end, 0);
+    if (errno != 0 || *end != '\0' || n > UINT32_MAX)
+        return false;
+    *v = static_cast<uint32_t>(n);
+    return true;
+}
+
+// A component by id or by exact name.
+bool componentArg(const std::string& s, uint32_t* id, std::string* out)
+{
+    uint32_t n;
+    if (parseNumber(s, &n)) {
+        for (const ComponentInfo& c : components())
+            if (c.id == n) {
+                *id = n;
+                return true;
+            }
+    } else if ((*id = componentId(s)) != 0) {
+        return true;
+    }
+    *out += "no component " + s + "\n";
+    return false;
+}
+
+// A group by id or by name or class.
+bool groupArg(uint32_t component, const std::string& s, uint32_t* id, std::string* out)
+{
+    uint32_t n;
+    bool numeric = parseNumber(s, &n);
+    for (const GroupInfo& g : groups(component))
+        if ((numeric && g.id == n) || (!numeric && (g.name == s || g.className == s))) {
+            *id = g.id;
+            return true;
+        }
+    *out += "no group " + s + " in component " + std::to_string(component) + "\n";
+    return false;
+}
+
+bool attributeArg(uint32_t component, uint32_t group, const std::string& s, uint32_t* id, std::string* out)
+{
+    uint32_t n;
+    bool numeric = parseNumber(s, &n);
+    for (const AttributeInfo& a : attributes(component, group))
+        if ((numeric && a.id == n) || (!numeric && a.name == s)) {
+            *id = a.id;
+            return true;
+        }
+    *out += "no attribute " + s + " in group " + std::to_string(group) + "\n";
+    return false;
+}
+
+// "-k VALUE" options (any number) from the current position.
+std::vector<std::string> keyArgs(Args& a)
+{
+    std::vector<std::string> keys;
+    while (a.at + 1 < a.words.size() && (a.words[a.at] == "-k" || a.words[a.at] == "--key")) {
+        keys.push_back(a.words[a.at + 1]);
+        a.at += 2;
+    }
+    return keys;
+}
+
+const char* statusText(uint32_t status)
+{
+    switch (status) {
+    case StatusOk: return "done";
+    case StatusNotFound: return "not found";
+    case StatusEndOfList: return "end of list";
+    case StatusBadKeys: return "keys do not name a row of this group";
+    case StatusReadOnly: return "attribute is read-only";
+    case StatusBadValue: return "value does not fit the attribute";
+    case StatusMalformed: return "malformed request";
+    case StatusBufferTooSmall: return "buffer too small";
+    case StatusInstallFailed: return "install failed";
+    case StatusWriteOnly: return "attribute is write-only";
+    case StatusStorageFailed: return "database not available";
+    }
+    return "failed";
+}
+
+int statusResult(uint32_t status, std::string* out)
+{
+    if (status == StatusOk)
+        return 0;
+    *out += std::string(statusText(status)) + "\n";
+    return status == StatusStorageFailed ? 3 : 1;
+}
+
+const char* typeName(uint32_t t)
+{
+    switch (t) {
+    case 1: return "counter";
+    case 2: return "counter64";
+    case 3: return "gauge";
+    case 5: return "integer";
+    case 6: return "integer64";
+    case 7: return "octetstring";
+    case 8: return "displaystring";
+    case 11: return "date";
+    }
+    return "?";
+}
+
+const char* accessName(uint32_t a)
+{
+    return a == AccessReadWrite ? "read-write" : a == AccessWriteOnly ? "write-only" : "read-only";
+}
+
+// Parses "C G [-k K]... [--instance G2 [-k K]...]" of the event commands.
+bool eventArgs(Args& a, uint32_t* component, EventRow* first, EventRow* instance, std::string* out)
+{
+    if (!a.more() || !componentArg(a.next(), component, out))
+        return false;
+    if (!a.more() || !groupArg(*component, a.next(), &first->group, out))
+        return false;
+    first->keys = keyArgs(a);
+    if (a.more() && a.words[a.at] == "--instance") {
+        ++a.at;
+        if (!a.more() || !groupArg(*component, a.next(), &instance->group, out))
+            return false;
+        instance->keys = keyArgs(a);
+    }
+    if (a.more()) {
+        *out += "unexpected argument " + a.words[a.at] + "\n";
+        return false;
+    }
+    return true;
+}
+
+} // namespace
+
+static const char* const usageText =
+    "usage: dmictl [--db DIR] [--socket PATH] COMMAND ...\n"
+    "  list                               installed components\n"
+    "  groups C                           groups of component C (id or name)\n"
+    "  attributes C G                     attributes of group G (id, name or class)\n"
+    "  rows C G                           rows of group G\n"
+    "  get C G A [-k KEY]...              one value; keys in key order name a table row\n"
+    "  set C G A VALUE [-k KEY]...        set one value (integer, enumeration text or string)\n"
+    "  mif C                              the component as MIF text with current values\n"
+    "  install FILE                       install a MIF file, prints the new component id\n"
+    "  uninstall C                        remove a component\n"
+    "  event C G [-k KEY]... [--instance G2 [-k KEY]...]\n"
+    "                                     raise a standard event from an EventGeneration row\n"
+    "  vendor-event C G [-k KEY]... [--instance G2 [-k KEY]...]\n"
+    "                                     raise a vendor error event (class Zorek|Error...)\n"
+    "  install-event C | uninstall-event C\n"
+    "                                     raise a component installed/uninstalled indication\n"
+    "  fault busy N | refuse [N] | no-confirm [N] | status512 N | delay MS | clear\n"
+    "  status                             counters of the running provider\n"
+    "exit codes: 0 done, 1 failed, 2 usage error, 3 provider or database unavailable\n";
+
+int runControl(const std::vector<std::string>& words, std::string* out)
+{
+    Args a{words, 0};
+    if (!a.more()) {
+        *out += usageText;
+        return 2;
+    }
+    const std::string cmd = a.next();
+    auto usage = [&]() {
+        *out += usageText;
+        return 2;
+    };
+    uint32_t c = 0, g = 0, at = 0;
+    if (cmd == "help" || cmd == "--help") {
+        *out += usageText;
+        return 0;
+    }
+    if (cmd == "list") {
+        if (a.more())
+            return usage();
+        for (const ComponentInfo& ci : components())
+            *out += std::to_string(ci.id) + "\t" + ci.name + "\n";
+        return 0;
+    }
+    if (cmd == "groups" || cmd == "mif" || cmd == "uninstall" || cmd == "install-event" || cmd == "uninstall-event") {
+        if (words.size() != 2)
+            return usage();
+        if (!componentArg(a.next(), &c, out))
+            return 1;
+        if (cmd == "groups") {
+            for (const GroupInfo& gi : groups(c)) {
+                *out += std::to_string(gi.id) + "\t" + gi.name + "\t" + gi.className;
+                if (!gi.keys.empty()) {
+                    *out += "\tkeys";
+                    for (uint32_t k : gi.keys)
+                        *out += " " + std::to_string(k);
+                    *out += "\trows " + std::to_string(gi.rowCount);
+                }
+                *out += "\n";
+            }
+            return 0;
+        }
+        if (cmd == "mif") {
+            *out += componentMif(c);
+            return 0;
+        }
+        if (cmd == "uninstall")
+            return statusResult(uninstall(c) ? StatusOk : StatusNotFound, out);
+        return statusResult(raiseInstallEvent(c, cmd == "install-event"), out);
+    }
+    if (cmd == "attributes" || cmd == "rows") {
+        if (words.size() != 3)
+            return usage();
+        if (!componentArg(a.next(), &c, out) || !groupArg(c, a.next(), &g, out))
+            return 1;
+        if (cmd == "attributes") {
+            for (const AttributeInfo& ai : attributes(c, g)) {
+                *out += std::to_string(ai.id) + "\t" + ai.name + "\t" + typeName(ai.type);
+                if (ai.type == 7 || ai.type == 8)
+                    *out += "(" + std::to_string(ai.maxSize) + ")";
+                *out += std::string("\t") + accessName(ai.access);
+                for (const auto& e : ai.enumeration)
+                    *out += "\t" + std::to_string(e.first) + "=" + e.second;
+                *out += "\n";
+            }
+            return 0;
+        }
+        for (const auto& row : rows(c, g)) {
+            for (size_t i = 0; i < row.size(); ++i)
+                *out += (i ? "\t" : "") + row[i];
+            *out += "\n";
+        }
+        return 0;
+    }
+    if (cmd == "get" || cmd == "set") {
+        if (words.size() < (cmd == "get" ? 4u : 5u))
+            return usage();
+        if (!componentArg(a.next(), &c, out) || !groupArg(c, a.next(), &g, out) ||
+            !attributeArg(c, g, a.next(), &at, out))
+            return 1;
+        std::string value;
+        if (cmd == "set")
+            value = a.next();
+        std::vector<std::string> keys = keyArgs(a);
+        if (a.more())
+            return usage();
+        if (cmd == "set")
+            return statusResult(setValue(c, g, at, keys, value), out);
+        uint32_t status = getValue(c, g, at, keys, &value);
+        if (status == StatusOk)
+            *out += value + "\n";
+        return statusResult(status, out);
+    }
+    if (cmd == "install") {
+        if (words.size() != 2)
+            return usage();
+        std::string error;
+        uint32_t id = install(a.next(), &error);
+        if (id == 0) {
+            *out += error + "\n";
+            return 1;
+        }
+        *out += std::to_string(id) + "\n";
+        return 0;
+    }
+    if (cmd == "event" || cmd == "vendor-event") {
+        EventRow first, instance;
+        if (!eventArgs(a, &c, &first, &instance, out))
+            return 1;
+        uint32_t status = cmd == "event" ? raiseEvent(c, first, instance) : raiseVendorEvent(c, first, instance);
+        if (status == StatusBadValue) {
+            *out += std::string("group ") + std::to_string(first.group) + " is not of class " +
+                    (cmd == "event" ? "EventGeneration|..." : "Zorek|Error...") + "\n";
+            return 1;
+        }
+        return statusResult(status, out);
+    }
+    if (cmd == "fault") {
+        if (!a.more())
+            return usage();
+        std::string kind = a.next();
+        uint32_t n = 1;
+        if (a.more() && !parseNumber(a.next(), &n))
+            return usage();
+        if (a.more())
+            return usage();
+        if (kind == "busy")
+            injectBusy(n);
+        else if (kind == "refuse")
+            injectRefuse(n);
+        else if (kind == "no-confirm")
+            injectNoConfirm(n);
+        else if (kind == "status512")
+            injectListingStatus512(n);
+        else if (kind == "delay")
+            injectConfirmDelay(n);
+        else if (kind == "clear")
+            clearFaults();
+        else
+            return usage();
+        return 0;
+    }
+    if (cmd == "status") {
+        *out += "database\t" + databaseDirectory() + "\n";
+        *out += "commands\t" + std::to_string(commandsReceived()) + "\n";
+        *out += "registrations\t" + std::to_string(registrations()) + "\n";
+        *out += "indications delivered\t" + std::to_string(indicationsDelivered()) + "\n";
+        *out += "indications outstanding\t" + std::to_string(indicationsOutstanding()) + "\n";
+        for (const std::string& e : loadErrors())
+            *out += "load error\t" + e + "\n";
+        return 0;
+    }
+    *out += "unknown command " + cmd + "\n";
+    return usage();
+}
+
+bool startControl(const std::string& path, std::string* error)
+{
+    std::lock_guard<std::mutex> lock(g_controlMu);
+    if (g_listenFd >= 0) {
+        *error = "already serving " + g_path;
+        return false;
+    }
+    struct sockaddr_un addr;
+    if (!fillAddress(path, &addr)) {
+        *error = "socket path too long";
+        return false;
+    }
+    int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    if (fd < 0) {
+        *error = std::strerror(errno);
+        return false;
+    }
+    // A socket left by a provider that died; the database lock is ours.
+    ::unlink(path.c_str());
+    if (::bind(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr) != 0 || ::listen(fd, 16) != 0 ||
+        ::pipe2(g_stopPipe, O_CLOEXEC) != 0) {
+        *error = std::strerror(errno);
+        ::close(fd);
+        return false;
+    }
+    g_listenFd = fd;
+    if (pthread_create(&g_thread, nullptr, controlThread, nullptr) != 0) {
+        *error = "cannot start the control thread";
+        ::close(g_listenFd);
+        ::close(g_stopPipe[0]);
+        ::close(g_stopPipe[1]);
+        g_listenFd = g_stopPipe[0] = g_stopPipe[1] = -1;
+        ::unlink(path.c_str());
+        return false;
+    }
+    g_path = path;
+    return true;
+}
+
+void stopControl()
+{
+    std::lock_guard<std::mutex> lock(g_controlMu);
+    if (g_listenFd < 0)
+        return;
+    char b = 1;
+    if (::write(g_stopPipe[1], &b, 1) != 1) {
+        // The pipe is empty and ours: a write cannot fail but for EINTR.
+    }
+    pthread_join(g_thread, nullptr);
+    ::close(g_listenFd);
+    ::close(g_stopPipe[0]);
+    ::close(g_stopPipe[1]);
+    g_listenFd = g_stopPipe[0] = g_stopPipe[1] = -1;
+    ::unlink(g_path.c_str());
+    g_path.clear();
+}
+
+std::string controlSocketPath()
+{
+    std::lock_guard<std::mutex> lock(g_controlMu);
+    return g_path;
+}
+
+int controlRequest(const std::string& socketPath, const std::vector<std::string>& args, std::string* out)
+{
+    struct sockaddr_un addr;
+    if (!fillAddress(socketPath, &addr))
+        return -1;
+    int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    if (fd < 0)
+        return -1;
+    if (::connect(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr) != 0) {
+        ::close(fd);
+        return -1;
+    }
+    bool ok = writeWord(fd, static_cast<uint32_t>(args.size()));
+    for (size_t i = 0; ok && i < args.size(); ++i)
+        ok = writeText(fd, args[i]);
+    uint32_t code = 0;
+    std::string reply;
+    ok = ok && readWord(fd, &code) && readText(fd, &reply);
+    ::close(fd);
+    if (!ok) {
+        *out += "no reply from the provider at " + socketPath + "\n";
+        return 3;
+    }
+    *out += reply;
+    return static_cast<int>(code);
+}
+
+} // namespace dmisp

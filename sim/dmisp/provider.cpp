@@ -1,0 +1,834 @@
+// The provider's state, its threads, DmiInvoke and the C++ interface.
+//
+// Threads: the command worker completes asynchronous commands in arrival
+// order and calls the confirm callbacks; the indication thread hands queued
+// indications to the registered indication callbacks; the control thread
+// (control.cpp) serves the control socket. One mutex guards the database
+// and every queue; no callback is called with it held.
+#include <atomic>
+#include <cerrno>
+#include <condition_variable>
+#include <cstdlib>
+#include <cstring>
+#include <deque>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <pthread.h>
+#include <strings.h>
+#include <time.h>
+
+#include "base/bytes.h"
+#include "dmisp/control.h"
+#include "dmisp/dmisp.h"
+#include "dmisp/miftext.h"
+#include "dmisp/records.h"
+
+namespace dmisp {
+
+namespace {
+
+typedef void* (*ConfirmFunction)(void* commandBlock);
+typedef void (*IndicationFunction)(void* indication);
+
+constexpr const char* DefaultDatabase = "/var/lib/dmisp";
+constexpr unsigned LockWaitMs = 2000;
+
+struct Registration {
+    uint32_t handle;
+    ConfirmFunction confirm;
+    IndicationFunction indicate;
+};
+
+struct Command {
+    uint8_t* block; // the caller's command block
+    uint8_t copy[CommandSize];
+    ConfirmFunction confirm;
+};
+
+struct State {
+    std::mutex mu;
+    std::condition_variable wake; // work for the worker or the indication thread
+    std::condition_variable idle; // a queue ran empty
+    Database db;
+    bool open = false;
+    bool stopping = false;
+    bool serveControl = false;
+    std::vector<Registration> registrations;
+    uint32_t nextHandle = 1;
+    std::deque<std::unique_ptr<Command>> commands;
+    bool working = false;
+    std::deque<std::vector<uint8_t>> indications;
+    bool delivering = false;
+    unsigned delivered = 0;
+    uint32_t levelCheck = LevelCheck;
+    // Faults.
+    unsigned busy = 0, refuse = 0, noConfirm = 0, listing512 = 0, delayMs = 0;
+    // Counters.
+    uint64_t received = 0;
+    std::map<uint32_t, uint64_t> receivedByCode;
+    pthread_t worker{}, indicator{};
+    bool threads = false;
+};
+
+// Never destroyed: provider threads may outlive static destruction.
+State& st()
+{
+    static State* s = new State;
+    return *s;
+}
+
+std::atomic<bool> g_open{false};
+std::atomic<unsigned> g_outstanding{0};
+// Serialises opening and closing.
+std::mutex g_lifecycle;
+
+void sleepMs(unsigned ms)
+{
+    struct timespec ts = {static_cast<time_t>(ms / 1000), static_cast<long>(ms % 1000) * 1000000L};
+    while (nanosleep(&ts, &ts) != 0 && errno == EINTR) {
+    }
+}
+
+// The completion callback of every indication the provider hands out.
+void indicationDone(void* indication)
+{
+    std::free(indication);
+    g_outstanding.fetch_sub(1);
+}
+
+uint32_t completionWord()
+{
+    return static_cast<uint32_t>(reinterpret_cast<uintptr_t>(&indicationDone));
+}
+
+// ---- threads --------------------------------------------------------------------
+
+// Copies an outcome into the caller's block and confirm buffer. A confirm
+// that does not fit the buffer named in words 7 and 8 is a failure and
+// nothing is written to the buffer.
+void deliverOutcome(uint8_t* block, const Outcome& o)
+{
+    uint32_t size = loadWordAt(block, 7);
+    void* buffer = wordPointer(loadWordAt(block, 8));
+    uint32_t status = o.status, count = o.count;
+    if (!o.confirm.empty()) {
+        if (buffer == nullptr || o.confirm.size() > size) {
+            status = StatusBufferTooSmall;
+            count = 0;
+        } else {
+            std::memcpy(buffer, o.confirm.data(), o.confirm.size());
+        }
+    }
+    storeWordAt(block, 10, count);
+    storeWordAt(block, 11, status);
+}
+
+// Register (256) and unregister (257), under the lock.
+Outcome managementCommand(State& s, const Command& c)
+{
+    Outcome o;
+    uint32_t code = loadWordAt(c.copy, 1);
+    if (code == 257) {
+        uint32_t handle = loadWordAt(c.copy, 3);
+        for (auto it = s.registrations.begin(); it != s.registrations.end(); ++it)
+            if (it->handle == handle) {
+                s.registrations.erase(it);
+                return o;
+            }
+        o.status = StatusNotFound;
+        return o;
+    }
+    Registration r;
+    r.handle = s.nextHandle++;
+    r.confirm = c.confirm;
+    r.indicate = reinterpret_cast<IndicationFunction>(static_cast<uintptr_t>(loadWordAt(c.copy, 17)));
+    // Confirm: offsets of the specification level and the implementation
+    // description, then the management handle.
+    const std::string level = "DMI 1.1";
+    const std::string implementation = "Mox substitute DMI service provider";
+    o.confirm.assign(12 + 4 + level.size() + 4 + implementation.size(), 0);
+    uint8_t* p = o.confirm.data();
+    storeWordAt(p, 0, 12);
+    storeWordAt(p, 1, static_cast<uint32_t>(16 + level.size()));
+    storeWordAt(p, 2, r.handle);
+    storeWord(p + 12, static_cast<uint32_t>(level.size()));
+    std::memcpy(p + 16, level.data(), level.size());
+    storeWord(p + 16 + level.size(), static_cast<uint32_t>(implementation.size()));
+    std::memcpy(p + 20 + level.size(), implementation.data(), implementation.size());
+    o.count = 1;
+    s.registrations.push_back(r);
+    return o;
+}
+
+void* workerThread(void*)
+{
+    State& s = st();
+    std::unique_lock<std::mutex> lock(s.mu);
+    for (;;) {
+        s.wake.wait(lock, [&] { return s.stopping || !s.commands.empty(); });
+        if (s.stopping)
+            break;
+        std::unique_ptr<Command> c = std::move(s.commands.front());
+        s.commands.pop_front();
+        s.working = true;
+        unsigned delay = s.delayMs;
+        lock.unlock();
+        if (delay != 0)
+            sleepMs(delay);
+        lock.lock();
+        Outcome o;
+        uint32_t code = loadWordAt(c->copy, 1);
+        uint32_t persist = 0;
+        if (loadWordAt(c->copy, 0) != LevelCheck)
+            o.status = StatusMalformed;
+        else if (code == 256 || code == 257)
+            o = managementCommand(s, *c);
+        else
+            o = executeCommand(s.db, c->copy, &persist);
+        if (persist != 0 && !s.db.persist(persist))
+            o.status = StatusStorageFailed;
+        if (o.status == StatusOk && code >= 512 && code <= 514 && s.listing512 > 0) {
+            --s.listing512;
+            o.status = StatusListing;
+        }
+        lock.unlock();
+        deliverOutcome(c->block, o);
+        c->confirm(c->block);
+        lock.lock();
+        s.working = false;
+        s.idle.notify_all();
+    }
+    return nullptr;
+}
+
+void* indicationThread(void*)
+{
+    State& s = st();
+    std::unique_lock<std::mutex> lock(s.mu);
+    for (;;) {
+        s.wake.wait(lock, [&] { return s.stopping || !s.indications.empty(); });
+        if (s.stopping)
+            break;
+        std::vector<uint8_t> ind = std::move(s.indications.front());
+        s.indications.pop_front();
+        s.delivering = true;
+        std::vector<Registration> targets = s.registrations;
+        lock.unlock();
+        unsigned handed = 0;
+        for (const Registration& r : targets) {
+            if (r.indicate == nullptr)
+                continue;
+            // Each application gets its own copy, freed by its completion.
+            void* copy = std::malloc(ind.size());
+            if (copy == nullptr)
+                continue;
+            std::memcpy(copy, ind.data(), ind.size());
+            g_outstanding.fetch_add(1);
+            r.indicate(copy);
+            ++handed;
+        }
+        lock.lock();
+        s.delivered += handed;
+        s.delivering = false;
+        s.idle.notify_all();
+    }
+    return nullptr;
+}
+
+// ---- lifecycle --------------------------------------------------------------------
+
+void closeLocked()
+{
+    State& s = st();
+    if (!s.open)
+        return;
+    stopControl();
+    {
+        std::lock_guard<std::mutex> lock(s.mu);
+        s.stopping = true;
+        s.wake.notify_all();
+    }
+    if (s.threads) {
+        pthread_join(s.worker, nullptr);
+        pthread_join(s.indicator, nullptr);
+        s.threads = false;
+    }
+    std::lock_guard<std::mutex> lock(s.mu);
+    s.commands.clear(); // never confirmed: the provider went away
+    s.indications.clear();
+    s.registrations.clear();
+    s.db.close();
+    s.open = false;
+    s.stopping = false;
+    s.working = s.delivering = false;
+    s.delivered = 0;
+    s.busy = s.refuse = s.noConfirm = s.listing512 = s.delayMs = 0;
+    s.received = 0;
+    s.receivedByCode.clear();
+    s.levelCheck = LevelCheck;
+    s.idle.notify_all();
+    g_open = false;
+}
+
+bool openLocked(const std::string& directory, bool serveControl, std::string* error)
+{
+    State& s = st();
+    closeLocked();
+    {
+        std::lock_guard<std::mutex> lock(s.mu);
+        if (!s.db.open(directory, LockWaitMs, error))
+            return false;
+        s.open = true;
+        if (pthread_create(&s.worker, nullptr, workerThread, nullptr) != 0) {
+            s.db.close();
+            s.open = false;
+            if (error != nullptr)
+                *error = "cannot start the provider thread";
+            return false;
+        }
+        if (pthread_create(&s.indicator, nullptr, indicationThread, nullptr) != 0) {
+            s.stopping = true;
+            s.wake.notify_all();
+            s.mu.unlock();
+            pthread_join(s.worker, nullptr);
+            s.mu.lock();
+            s.stopping = false;
+            s.db.close();
+            s.open = false;
+            if (error != nullptr)
+                *error = "cannot start the indication thread";
+            return false;
+        }
+        s.threads = true;
+    }
+    g_open = true;
+    if (serveControl) {
+        const char* env = std::getenv("DMISP_SOCKET");
+        std::string path = (env != nullptr && *env != '\0') ? env : directory + "/control.sock";
+        std::string controlError;
+        if (!startControl(path, &controlError))
+            std::fprintf(stderr, "dmisp: control socket %s: %s\n", path.c_str(), controlError.c_str());
+    }
+    return true;
+}
+
+// Opens the database named by DMISP_DB on first use.
+bool ensureOpen()
+{
+    if (g_open)
+        return true;
+    std::lock_guard<std::mutex> lock(g_lifecycle);
+    if (st().open)
+        return true;
+    const char* env = std::getenv("DMISP_DB");
+    std::string error;
+    if (!openLocked((env != nullptr && *env != '\0') ? env : DefaultDatabase, true, &error)) {
+        std::fprintf(stderr, "dmisp: %s\n", error.c_str());
+        return false;
+    }
+    return true;
+}
+
+// ---- database operations (under the lock) -----------------------------------------
+
+void queueIndication(State& s, std::vector<uint8_t> ind)
+{
+    s.indications.push_back(std::move(ind));
+    s.wake.notify_all();
+}
+
+uint32_t installParsed(State& s, Component c, std::string* error)
+{
+    uint32_t id = s.db.install(std::move(c), error);
+    if (id != 0)
+        queueIndication(s, componentIndication(*s.db.find(id), 2, s.levelCheck, completionWord()));
+    return id;
+}
+
+bool uninstallLocked(State& s, uint32_t id)
+{
+    const Component* c = s.db.find(id);
+    if (c == nullptr)
+        return false;
+    std::vector<uint8_t> ind = componentIndication(*c, 3, s.levelCheck, completionWord());
+    s.db.uninstall(id);
+    queueIndication(s, std::move(ind));
+    return true;
+}
+
+bool readText(const std::string& path, std::string* text, std::string* error)
+{
+    FILE* f = std::fopen(path.c_str(), "rb");
+    if (f == nullptr) {
+        if (error != nullptr)
+            *error = path + ": " + std::strerror(errno);
+        return false;
+    }
+    text->clear();
+    char buf[65536];
+    size_t n;
+    while ((n = std::fread(buf, 1, sizeof buf, f)) > 0)
+        text->append(buf, n);
+    bool ok = !std::ferror(f);
+    std::fclose(f);
+    if (!ok && error != nullptr)
+        *error = path + ": read error";
+    return ok;
+}
+
+// The row of `g` named by key texts, or -1 with a Status.
+long rowByKeyTexts(const Group& g, const std::vector<std::string>& keys, uint32_t* status)
+{
+    if (g.keys.empty()) {
+        if (g.rows.empty()) {
+            *status = StatusNotFound;
+            return -1;
+        }
+        return 0;
+    }
+    if (keys.size() != g.keys.size()) {
+        *status = StatusBadKeys;
+        return -1;
+    }
+    std::vector<Value> values;
+    for (size_t k = 0; k < keys.size(); ++k) {
+        Value v;
+        if (!valueFromText(g.attributes[static_cast<size_t>(g.attributeIndex(g.keys[k]))], keys[k], &v)) {
+            *status = StatusBadKeys;
+            return -1;
+        }
+        values.push_back(v);
+    }
+    long row = g.findRow(values);
+    if (row < 0)
+        *status = StatusNotFound;
+    return row;
+}
+
+bool hasPrefix(const std::string& s, const char* prefix)
+{
+    size_t n = std::strlen(prefix);
+    return s.size() >= n && strncasecmp(s.c_str(), prefix, n) == 0;
+}
+
+uint32_t raise(uint32_t component, const EventRow& first, const EventRow& instance, const char* prefix)
+{
+    if (!ensureOpen())
+        return StatusStorageFailed;
+    State& s = st();
+    std::lock_guard<std::mutex> lock(s.mu);
+    const Component* c = s.db.find(component);
+    if (c == nullptr)
+        return StatusNotFound;
+    std::vector<EventClassRow> classes;
+    for (const EventRow* r : {&first, &instance}) {
+        if (r == &instance && r->group == 0)
+            break;
+        const Group* g = c->group(r->group);
+        if (g == nullptr)
+            return StatusNotFound;
+        if (r == &first && !hasPrefix(g->className, prefix))
+            return StatusBadValue;
+        uint32_t status = StatusOk;
+        long row = rowByKeyTexts(*g, r->keys, &status);
+        if (row < 0)
+            return status;
+        classes.push_back({g, static_cast<size_t>(row)});
+    }
+    queueIndication(s, eventIndication(*c, classes, s.levelCheck, completionWord()));
+    return StatusOk;
+}
+
+template <typename F>
+bool waitFor(std::condition_variable& cv, std::unique_lock<std::mutex>& lock, unsigned timeoutMs, F done)
+{
+    return cv.wait_for(lock, std::chrono::milliseconds(timeoutMs), done);
+}
+
+} // namespace
+
+// ---- the C++ interface ----------------------------------------------------------------
+
+int reset(const std::string& directory, bool serveControl, std::string* error)
+{
+    std::lock_guard<std::mutex> lock(g_lifecycle);
+    return openLocked(directory, serveControl, error) ? 0 : -1;
+}
+
+void shutdown()
+{
+    std::lock_guard<std::mutex> lock(g_lifecycle);
+    closeLocked();
+}
+
+std::string databaseDirectory()
+{
+    std::lock_guard<std::mutex> lock(st().mu);
+    return st().db.directory();
+}
+
+std::vector<std::string> loadErrors()
+{
+    std::lock_guard<std::mutex> lock(st().mu);
+    return st().db.loadErrors();
+}
+
+uint32_t installText(const std::string& text, const std::string& name, std::string* error)
+{
+    Component c;
+    if (!parseMif(text, name, &c, error))
+        return 0;
+    if (!ensureOpen()) {
+        if (error != nullptr)
+            *error = "the provider database cannot be opened";
+        return 0;
+    }
+    std::lock_guard<std::mutex> lock(st().mu);
+    return installParsed(st(), std::move(c), error);
+}
+
+uint32_t install(const std::string& mifPath, std::string* error)
+{
+    std::string text;
+    if (!readText(mifPath, &text, error))
+        return 0;
+    return installText(text, mifPath, error);
+}
+
+bool uninstall(uint32_t component)
+{
+    if (!ensureOpen())
+        return false;
+    std::lock_guard<std::mutex> lock(st().mu);
+    return uninstallLocked(st(), component);
+}
+
+std::vector<ComponentInfo> components()
+{
+    std::vector<ComponentInfo> out;
+    if (!ensureOpen())
+        return out;
+    std::lock_guard<std::mutex> lock(st().mu);
+    for (const auto& [id, c] : st().db.components())
+        out.push_back({id, c.name, c.description});
+    return out;
+}
+
+uint32_t componentId(const std::string& name)
+{
+    for (const ComponentInfo& c : components())
+        if (c.name == name)
+            return c.id;
+    return 0;
+}
+
+std::vector<GroupInfo> groups(uint32_t component)
+{
+    std::vector<GroupInfo> out;
+    if (!ensureOpen())
+        return out;
+    std::lock_guard<std::mutex> lock(st().mu);
+    const Component* c = st().db.find(component);
+    if (c != nullptr)
+        for (const Group& g : c->groups)
+            out.push_back({g.id, g.name, g.className, g.description, g.keys, static_cast<uint32_t>(g.rows.size())});
+    return out;
+}
+
+std::vector<AttributeInfo> attributes(uint32_t component, uint32_t group)
+{
+    std::vector<AttributeInfo> out;
+    if (!ensureOpen())
+        return out;
+    std::lock_guard<std::mutex> lock(st().mu);
+    const Component* c = st().db.find(component);
+    const Group* g = c != nullptr ? c->group(group) : nullptr;
+    if (g != nullptr)
+        for (const Attribute& a : g->attributes)
+            out.push_back({a.id, a.name, a.description, a.type, a.access, a.maxSize, a.enumeration});
+    return out;
+}
+
+std::vector<std::vector<std::string>> rows(uint32_t component, uint32_t group)
+{
+    std::vector<std::vector<std::string>> out;
+    if (!ensureOpen())
+        return out;
+    std::lock_guard<std::mutex> lock(st().mu);
+    const Component* c = st().db.find(component);
+    const Group* g = c != nullptr ? c->group(group) : nullptr;
+    if (g != nullptr)
+        for (const Row& r : g->rows) {
+            std::vector<std::string> texts;
+            for (size_t i = 0; i < r.size(); ++i)
+                texts.push_back(valueText(g->attributes[i], r[i]));
+            out.push_back(std::move(texts));
+        }
+    return out;
+}
+
+uint32_t getValue(uint32_t component, uint32_t group, uint32_t attribute, const std::vector<std::string>& keys,
+                  std::string* value)
+{
+    if (!ensureOpen())
+        return StatusStorageFailed;
+    std::lock_guard<std::mutex> lock(st().mu);
+    const Component* c = st().db.find(component);
+    const Group* g = c != nullptr ? c->group(group) : nullptr;
+    int ai = g != nullptr ? g->attributeIndex(attribute) : -1;
+    if (ai < 0)
+        return StatusNotFound;
+    uint32_t status = StatusOk;
+    long row = rowByKeyTexts(*g, keys, &status);
+    if (row < 0)
+        return status;
+    *value = valueText(g->attributes[static_cast<size_t>(ai)], g->rows[static_cast<size_t>(row)][static_cast<size_t>(ai)]);
+    return StatusOk;
+}
+
+uint32_t setValue(uint32_t component, uint32_t group, uint32_t attribute, const std::vector<std::string>& keys,
+                  const std::string& text)
+{
+    if (!ensureOpen())
+        return StatusStorageFailed;
+    State& s = st();
+    std::lock_guard<std::mutex> lock(s.mu);
+    Component* c = s.db.find(component);
+    Group* g = c != nullptr ? c->group(group) : nullptr;
+    int ai = g != nullptr ? g->attributeIndex(attribute) : -1;
+    if (ai < 0)
+        return StatusNotFound;
+    uint32_t status = StatusOk;
+    long row = rowByKeyTexts(*g, keys, &status);
+    if (row < 0)
+        return status;
+    Attribute& a = g->attributes[static_cast<size_t>(ai)];
+    Value v;
+    if (!valueFromText(a, text, &v))
+        return StatusBadValue;
+    Value& current = g->rows[static_cast<size_t>(row)][static_cast<size_t>(ai)];
+    Value old = current, oldTemplate = a.value;
+    current = v;
+    if (g->keys.empty())
+        a.value = v;
+    if (!g->reindex()) {
+        current = old;
+        a.value = oldTemplate;
+        g->reindex();
+        return StatusBadValue;
+    }
+    if (!s.db.persist(component)) {
+        current = old;
+        a.value = oldTemplate;
+        g->reindex();
+        return StatusStorageFailed;
+    }
+    return StatusOk;
+}
+
+std::string componentMif(uint32_t component)
+{
+    if (!ensureOpen())
+        return "";
+    std::lock_guard<std::mutex> lock(st().mu);
+    const Component* c = st().db.find(component);
+    return c != nullptr ? writeMif(*c) : "";
+}
+
+uint32_t raiseEvent(uint32_t component, const EventRow& event, const EventRow& instance)
+{
+    return raise(component, event, instance, "EventGeneration|");
+}
+
+uint32_t raiseVendorEvent(uint32_t component, const EventRow& error, const EventRow& instance)
+{
+    return raise(component, error, instance, "Zorek|Error");
+}
+
+uint32_t raiseInstallEvent(uint32_t component, bool installed)
+{
+    if (!ensureOpen())
+        return StatusStorageFailed;
+    State& s = st();
+    std::lock_guard<std::mutex> lock(s.mu);
+    const Component* c = s.db.find(component);
+    if (c == nullptr)
+        return StatusNotFound;
+    queueIndication(s, componentIndication(*c, installed ? 2 : 3, s.levelCheck, completionWord()));
+    return StatusOk;
+}
+
+void setIndicationLevelCheck(uint32_t levelCheck)
+{
+    std::lock_guard<std::mutex> lock(st().mu);
+    st().levelCheck = levelCheck;
+}
+
+bool waitIndicationsDelivered(unsigned timeoutMs)
+{
+    State& s = st();
+    std::unique_lock<std::mutex> lock(s.mu);
+    return waitFor(s.idle, lock, timeoutMs, [&] { return s.indications.empty() && !s.delivering; });
+}
+
+unsigned indicationsOutstanding()
+{
+    return g_outstanding.load();
+}
+
+unsigned indicationsDelivered()
+{
+    std::lock_guard<std::mutex> lock(st().mu);
+    return st().delivered;
+}
+
+unsigned registrations()
+{
+    std::lock_guard<std::mutex> lock(st().mu);
+    return static_cast<unsigned>(st().registrations.size());
+}
+
+void injectBusy(unsigned times)
+{
+    std::lock_guard<std::mutex> lock(st().mu);
+    st().busy = times;
+}
+
+void injectRefuse(unsigned times)
+{
+    std::lock_guard<std::mutex> lock(st().mu);
+    st().refuse = times;
+}
+
+void injectNoConfirm(unsigned times)
+{
+    std::lock_guard<std::mutex> lock(st().mu);
+    st().noConfirm = times;
+}
+
+void injectListingStatus512(unsigned times)
+{
+    std::lock_guard<std::mutex> lock(st().mu);
+    st().listing512 = times;
+}
+
+void injectConfirmDelay(unsigned ms)
+{
+    std::lock_guard<std::mutex> lock(st().mu);
+    st().delayMs = ms;
+}
+
+void clearFaults()
+{
+    std::lock_guard<std::mutex> lock(st().mu);
+    State& s = st();
+    s.busy = s.refuse = s.noConfirm = s.listing512 = s.delayMs = 0;
+}
+
+uint64_t commandsReceived()
+{
+    std::lock_guard<std::mutex> lock(st().mu);
+    return st().received;
+}
+
+uint64_t commandsReceived(uint32_t code)
+{
+    std::lock_guard<std::mutex> lock(st().mu);
+    auto it = st().receivedByCode.find(code);
+    return it == st().receivedByCode.end() ? 0 : it->second;
+}
+
+bool waitCommandsIdle(unsigned timeoutMs)
+{
+    State& s = st();
+    std::unique_lock<std::mutex> lock(s.mu);
+    return waitFor(s.idle, lock, timeoutMs, [&] { return s.commands.empty() && !s.working; });
+}
+
+} // namespace dmisp
+
+// ---- the management-interface entry point ---------------------------------------------
+
+using namespace dmisp;
+
+extern "C" __attribute__((visibility("default"))) uint32_t DmiInvoke(void* commandBlock)
+{
+    if (commandBlock == nullptr || !ensureOpen())
+        return InvokeRefused;
+    uint8_t* block = static_cast<uint8_t*>(commandBlock);
+    State& s = st();
+    std::unique_lock<std::mutex> lock(s.mu);
+    uint32_t code = loadWordAt(block, 1);
+    ++s.received;
+    ++s.receivedByCode[code];
+    if (s.busy > 0) {
+        --s.busy;
+        return InvokeBusy;
+    }
+    if (s.refuse > 0) {
+        --s.refuse;
+        return InvokeRefused;
+    }
+    if (code >= 1024 && code <= 1027) {
+        // Component-interface commands complete before returning.
+        Outcome o;
+        if (loadWordAt(block, 0) != LevelCheck) {
+            o.status = StatusMalformed;
+        } else if (code == 1026) {
+            std::string path, text, error;
+            Component c;
+            if (!installPath(block, &path)) {
+                o.status = StatusMalformed;
+            } else {
+                // Reading and parsing need no lock.
+                lock.unlock();
+                bool parsed = readText(path, &text, &error) && parseMif(text, path, &c, &error);
+                lock.lock();
+                uint32_t id = parsed ? installParsed(s, std::move(c), &error) : 0;
+                if (id == 0) {
+                    std::fprintf(stderr, "dmisp: install refused: %s\n", error.c_str());
+                    o.status = StatusInstallFailed;
+                } else {
+                    // The new component's id comes back in the command's
+                    // component word.
+                    storeWordAt(block, 16, id);
+                    o.count = 1;
+                }
+            }
+        } else if (code == 1027) {
+            o.status = uninstallLocked(s, loadWordAt(block, 16)) ? StatusOk : StatusNotFound;
+        } else {
+            uint32_t persist = 0;
+            o = executeCommand(s.db, block, &persist);
+        }
+        deliverOutcome(block, o);
+        return InvokeAccepted;
+    }
+    ConfirmFunction confirm = nullptr;
+    if (code == 256) {
+        confirm = reinterpret_cast<ConfirmFunction>(static_cast<uintptr_t>(loadWordAt(block, 16)));
+    } else {
+        uint32_t handle = loadWordAt(block, 3);
+        for (const Registration& r : s.registrations)
+            if (r.handle == handle)
+                confirm = r.confirm;
+        // Commands sent before or without registration go to the latest
+        // registration's callback.
+        if (confirm == nullptr && !s.registrations.empty())
+            confirm = s.registrations.back().confirm;
+    }
+    if (confirm == nullptr)
+        return InvokeRefused; // nobody to confirm to
+    if (s.noConfirm > 0) {
+        --s.noConfirm;
+        return InvokeAccepted;
+    }
+    auto c = std::make_unique<Command>();
+    c->block = block;
+    std::memcpy(c->copy, block, CommandSize);
+    c->confirm = confirm;
+    s.commands.push_back(std::move(c));
+    s.wake.notify_all();
+    return InvokeAccepted;
+}
