@@ -6,6 +6,8 @@
 // success).
 #pragma once
 
+#include <atomic>
+
 #include "sl/sltypes.h"
 
 extern "C" {
@@ -60,3 +62,6 @@ int SLCiUninstallData(SLHandle* h, uint32_t component);
 // Size in bytes of a DMI value of `type`; strings by their count.
 unsigned SLAttributeSize(int type, const void* value);
 }
+
+// Set by SLIndicateDown; nothing in the library consults it.
+extern std::atomic<int> SLLibDownFlag;

@@ -147,6 +147,11 @@ uint32_t rowEntryWord(SLHandle* h, uint32_t i, uint32_t field)
 
 } // namespace
 
+const uint8_t* slConfirmBytes(SLHandle* h, uint64_t offset, uint64_t length)
+{
+    return inConfirm(h, offset, length);
+}
+
 const uint8_t* pGetRow(SLHandle* h)
 {
     int64_t row = rowOffset(h);
