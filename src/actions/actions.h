@@ -1,8 +1,55 @@
 // Action dispatch and the local notifications.
 #pragma once
 
+#include <cstdint>
+
 #include "events/eventrecord.h"
 #include "sl/sltypes.h"
 
-// Hands the event to the alarm daemon and writes its system-log line.
-void LogEvent(SLHandle* indication, EventRecord* record);
+// Every action handler receives the event's indication and record; results
+// are ignored.
+typedef int (*ActionHandler)(SLHandle* indication, EventRecord* record);
+
+struct ActionEntry {
+    uint32_t code; // 0 ends the table
+    ActionHandler handler;
+};
+
+// Action code and the position of its switch in an actions-table row read
+// after attribute 6; the table order is the order in which actions run.
+struct ActionOrder {
+    uint32_t code; // 0 ends the table
+    uint32_t position;
+};
+extern const ActionOrder ActionID[];
+extern const ActionEntry lscActions[];
+
+// Runs the handler of `code` when `value` is non-zero.
+void DoAction(uint32_t code, uint32_t value, SLHandle* indication, EventRecord* record);
+
+int ConsoleMessage(SLHandle* indication, EventRecord* record);
+int BeepSpeaker(SLHandle* indication, EventRecord* record);
+// Hands the event to the alarm daemon, then writes its system-log line.
+int LogEvent(SLHandle* indication, EventRecord* record);
+int BroadcastMessage(SLHandle* indication, EventRecord* record);
+int writeToLCD(SLHandle* indication, EventRecord* record);
+int issuePage(SLHandle* indication, EventRecord* record);
+int MoxIdLedOff(SLHandle* indication, EventRecord* record);
+int MoxIdLedBlink(SLHandle* indication, EventRecord* record);
+int shutdownOS(SLHandle* indication, EventRecord* record);
+int shutdownAndPowerOff(SLHandle* indication, EventRecord* record);
+int shutdownAndresetsystem(SLHandle* indication, EventRecord* record);
+int powerOff(SLHandle* indication, EventRecord* record);
+int resetSystem(SLHandle* indication, EventRecord* record);
+int issueNMI(SLHandle* indication, EventRecord* record);
+
+// The event message in a new SL string (caller deletes it with
+// SLDeleteString); null when it cannot be created.
+char* createEventMessage(EventRecord* record);
+// The text naming the row the event concerns: "Not Applicable" without a key
+// list, else the row's name, else its first key's value. `handle` is a working
+// handle whose confirm buffer is overwritten.
+void rowLabel(SLHandle* handle, EventRecord* record, char* out, unsigned size);
+
+// The handler table DoAction consults; tests record the calls with their own.
+const ActionEntry* actionsSetHandlers(const ActionEntry* table);

@@ -1,5 +1,116 @@
 #include "events/oldevent.h"
 
-void ZorekEventActions(SLHandle*)
+#include <cstring>
+
+#include "events/stdevent.h"
+#include "mif/mif.h"
+#include "sl/sl.h"
+#include "sl/slaccess.h"
+#include "sl/slhandle.h"
+#include "sl/slkey.h"
+
+namespace {
+
+constexpr uint32_t vendorActionsGroup = 4;
+constexpr uint32_t firstActionAttribute = 6;
+constexpr uint32_t anyValue = 0x80000000u;
+
+} // namespace
+
+void fillKey(SLKeyList* keys, uint32_t* mifId, uint32_t* group, uint32_t* instance, uint32_t* attribute,
+             uint32_t* value, uint32_t* state)
 {
+    std::memset(keys, 0, sizeof *keys);
+    keys->firstWord = 4;
+    keys->count = 6;
+    uint32_t* values[] = {mifId, group, instance, attribute, value, state};
+    for (uint32_t i = 0; i < 6; ++i) {
+        keys->keys[i].attributeId = i + 1;
+        keys->keys[i].type = DMI_INTEGER;
+        keys->keys[i].value = values[i];
+    }
+}
+
+void matchZorekEvents(SLHandle* indication, EventRecord* record)
+{
+    uint32_t mifId = GetMifId(record->componentId);
+    if (mifId == 0)
+        return;
+    uint32_t group = record->groupId;
+    uint32_t attribute = record->attributeId;
+    uint32_t value = record->attributeValue;
+    uint32_t state = record->errorState;
+    if (mifId == 1) {
+        // The baseboard's rows are looked up without its value and state.
+        value = 0;
+        state = 0;
+    }
+    uint32_t eventInstance = firstKeyValue(record->keyList);
+
+    SLHandle* handle = SLCreateHandle(0);
+    if (handle == nullptr)
+        return;
+    // The key list lives here and points at these locals; it is never
+    // handed to SLDeleteKeyList.
+    SLKeyList keys;
+    uint32_t instance = 0;
+    uint32_t lookupValue = 0;
+    fillKey(&keys, &mifId, &group, &instance, &attribute, &lookupValue, &state);
+    const struct {
+        uint32_t instance, value;
+    } tries[] = {{eventInstance, value}, {eventInstance, anyValue}, {0, value}, {0, anyValue}};
+    uint32_t own = MyComponentId();
+    for (const auto& t : tries) {
+        instance = t.instance;
+        lookupValue = t.value;
+        if (SLGetRow(handle, own, vendorActionsGroup, firstActionAttribute, &keys) == 0) {
+            runRowActions(handle, indication, record);
+            break;
+        }
+    }
+    SLDestroyHandle(handle);
+}
+
+void ZorekEventActions(SLHandle* indication)
+{
+    EventRecord record{};
+    record.eventKind = EVENT_VENDOR;
+    SLHandle* lookup = SLCreateHandle(0);
+    if (lookup == nullptr)
+        return;
+    bool match = false;
+    if (SLEventClassCount(indication) != 0) {
+        record.componentId = SLEventComponentId(indication, 0);
+        record.componentName = ComponentName(record.componentId);
+        if (SLEventRowCount(indication, 0) != 0) {
+            SLEventSelectRowCnf(indication, 0, 0);
+            match = SLRowAttributeCount(indication) != 0;
+        }
+    }
+    if (match) {
+        record.errorState = SLRowUnsignedValue(indication, 0);
+        if (SLEventClassCount(indication) >= 2) {
+            if (SLEventRowCount(indication, 1) == 0) {
+                match = false;
+            } else {
+                SLEventSelectRowCnf(indication, 1, 0);
+                record.groupId = SLRowGroupId(indication);
+                record.groupName = GroupName(lookup, record.componentId, record.groupId);
+                if (SLKeyCount(indication) > 0) {
+                    record.keyList = SLCreateKeyList(indication);
+                    match = record.keyList != nullptr;
+                }
+                if (match && SLRowAttributeCount(indication) > 0) {
+                    record.attributeId = SLRowAttributeId(indication, 0);
+                    record.attributeName = AttributeName(lookup, record.componentId, record.groupId,
+                                                         record.attributeId);
+                    record.attributeValue = SLRowUnsignedValue(indication, 0);
+                }
+            }
+        }
+    }
+    if (match)
+        matchZorekEvents(indication, &record);
+    SLDeleteKeyList(record.keyList);
+    SLDestroyHandle(lookup);
 }

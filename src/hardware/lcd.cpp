@@ -4,3 +4,7 @@ int LcdInitialize(void)
 {
     return -1;
 }
+
+void WriteLCD(const char*)
+{
+}

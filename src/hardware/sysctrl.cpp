@@ -4,3 +4,15 @@ int SysCtrlInitialize(void)
 {
     return -1;
 }
+
+void SysCtrlPage(void)
+{
+}
+
+void SysCtrlIdLedOff(void)
+{
+}
+
+void SysCtrlIdLedBlink(void)
+{
+}

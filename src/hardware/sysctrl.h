@@ -3,3 +3,6 @@
 
 // 0 when the system-control group is known, -1 otherwise.
 int SysCtrlInitialize(void);
+void SysCtrlPage(void);
+void SysCtrlIdLedOff(void);
+void SysCtrlIdLedBlink(void);
