@@ -278,7 +278,9 @@ int fetchMessage(uint8_t* message, uint32_t* length, int timeout, uint32_t* sequ
         } else if (!withSession) {
             if (count < 1)
                 return ObxResultError;
-            if (bytes[0] == (channel & 0xFF)) {
+            // Bits 7-4 carry the sender's privilege: comparing the whole byte
+            // would pass over, and so lose, every message sent with one.
+            if ((bytes[0] & 0x0Fu) == channel) {
                 std::memcpy(message, bytes + 1, count - 1);
                 *length = count - 1;
                 *sequence = delivered;
