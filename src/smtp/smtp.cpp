@@ -21,6 +21,7 @@ namespace {
 
 std::atomic<uint16_t> gs_smtpPort{25};
 std::atomic<unsigned> gs_limitMs{8000};
+std::atomic<SmtpWritableHook> gs_writableHook{nullptr};
 
 constexpr size_t COMMAND_SIZE = 1024;
 constexpr size_t REPLY_SIZE = 1024;
@@ -49,11 +50,14 @@ int msLeft(int64_t deadline)
     return left > INT_MAX ? INT_MAX : static_cast<int>(left);
 }
 
-// Waits until the socket has room to send, at most until the deadline (a
-// deadline already past still polls once). poll, unlike select, has no limit
-// on the descriptor's number.
-bool waitWritable(int sock, int64_t deadline)
+// Waits until the socket has room to send, at most timeoutMs (0 still polls
+// once). poll, unlike select, has no limit on the descriptor's number.
+bool waitWritable(int sock, int timeoutMs)
 {
+    SmtpWritableHook hook = gs_writableHook.load();
+    if (hook != nullptr)
+        return hook(sock, timeoutMs);
+    const int64_t deadline = nowMs() + timeoutMs;
     for (;;) {
         pollfd p{sock, POLLOUT, 0};
         int r = poll(&p, 1, msLeft(deadline));
@@ -72,7 +76,7 @@ bool isControl(char c)
 struct Dialogue {
     int sock = -1;
     int code = 0; // reply code; an unnumbered reply keeps it
-    int64_t writeDeadline = 0;
+    int allowanceMs = 0; // what is left of the writability allowance
     char server[EMAIL_SERVER_SIZE] = {}; // the server text as sent and logged
     char command[COMMAND_SIZE] = {};
     size_t commandLength = 0;
@@ -117,8 +121,13 @@ int runStage(Dialogue& d, const Stage& s, int waits = 1)
 {
     if (s.sendStep != 0) {
         bool writable = false;
-        for (int i = 0; i < waits && !writable; i++)
-            writable = waitWritable(d.sock, d.writeDeadline);
+        for (int i = 0; i < waits && !writable; i++) {
+            // Each wait uses up the time it spends; reading replies does not.
+            const int64_t start = nowMs();
+            writable = waitWritable(d.sock, d.allowanceMs);
+            const int64_t spent = nowMs() - start;
+            d.allowanceMs = spent >= d.allowanceMs ? 0 : d.allowanceMs - static_cast<int>(spent);
+        }
         if (writable) {
             ssize_t sent = send(d.sock, d.command, d.commandLength, MSG_NOSIGNAL);
             if (sent < 0)
@@ -149,6 +158,11 @@ void smtpSetPort(uint16_t port)
 void smtpSetLimitMs(unsigned milliseconds)
 {
     gs_limitMs.store(milliseconds);
+}
+
+void smtpSetWritableHook(SmtpWritableHook hook)
+{
+    gs_writableHook.store(hook);
 }
 
 void smtpSanitize(char* text)
@@ -401,7 +415,7 @@ int _MoxSendEmail(EmailConfig* config)
     timeval sendLimit{static_cast<time_t>(limit / 1000), static_cast<suseconds_t>((limit % 1000) * 1000)};
     setsockopt(d.sock, SOL_SOCKET, SO_SNDTIMEO, &sendLimit, sizeof sendLimit);
     // One allowance for all the writability waits of the dialogue.
-    d.writeDeadline = nowMs() + limit;
+    d.allowanceMs = limit > INT_MAX ? INT_MAX : static_cast<int>(limit);
 
     if (!runStage(d, {220, 0, nullptr, 4, CONNECT_READ_FAILED, 5}))
         return 0;

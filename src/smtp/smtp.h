@@ -102,3 +102,7 @@ size_t smtpCopySanitized(char* out, size_t outSize, const char* text, size_t max
 // milliseconds of the reply limit and the writability allowance (8000).
 void smtpSetPort(uint16_t port);
 void smtpSetLimitMs(unsigned milliseconds);
+// Test seam: replaces the writability wait (the socket, the milliseconds the
+// wait may take; true when the socket became writable). Null restores poll.
+using SmtpWritableHook = bool (*)(int sock, int timeoutMs);
+void smtpSetWritableHook(SmtpWritableHook hook);

@@ -1,0 +1,110 @@
+// Delivers alerts to a real SMTP server (python3-aiosmtpd from Debian's
+// packages) started on loopback, and reads back what it stored.
+#include <gtest/gtest.h>
+
+#include <csignal>
+#include <fstream>
+#include <poll.h>
+#include <sstream>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include "smtp_test_support.h"
+
+namespace {
+
+const char PYTHON[] = "/usr/bin/python3";
+
+class LoopbackServer {
+public:
+    explicit LoopbackServer(const std::string& folder)
+    {
+        int out[2];
+        if (pipe(out) != 0)
+            return;
+        pid_ = fork();
+        if (pid_ == 0) {
+            dup2(out[1], 1);
+            close(out[0]);
+            close(out[1]);
+            execl(PYTHON, PYTHON, MOX_SMTPD_SCRIPT, folder.c_str(), static_cast<char*>(nullptr));
+            _exit(127);
+        }
+        close(out[1]);
+        std::string line;
+        pollfd p{out[0], POLLIN, 0};
+        char c;
+        while (line.find('\n') == std::string::npos && poll(&p, 1, 10000) > 0 && read(out[0], &c, 1) == 1)
+            line += c;
+        close(out[0]);
+        port_ = static_cast<uint16_t>(atoi(line.c_str()));
+    }
+    ~LoopbackServer()
+    {
+        if (pid_ > 0) {
+            kill(pid_, SIGTERM);
+            waitpid(pid_, nullptr, 0);
+        }
+    }
+    uint16_t port() const { return port_; }
+
+private:
+    pid_t pid_ = -1;
+    uint16_t port_ = 0;
+};
+
+std::string readFile(const std::string& path)
+{
+    std::ifstream in(path, std::ios::binary);
+    std::stringstream text;
+    text << in.rdbuf();
+    return text.str();
+}
+
+using SmtpDelivery = SmtpTest;
+
+TEST_F(SmtpDelivery, AlertIsStoredByARealServer)
+{
+    std::string probe = std::string(PYTHON) + " -c 'import aiosmtpd' 2>/dev/null";
+    if (system(probe.c_str()) != 0)
+        GTEST_SKIP() << "python3-aiosmtpd is not installed: the delivery to a real SMTP server is not checked";
+
+    struct Case {
+        const char* name;
+        std::string body;   // as composed: lines ended by a bare line feed
+        std::string stored; // the data as the server keeps it
+    } cases[] = {
+        {"alert", "Check Fan 1 at server alpha\nEvent Type:Warning\nEvent Severity:Critical\n"
+                  "Component:Baseboard\nGroup:Fan 1\nInstance:CPU 1\n",
+         "SUBJECT:Zorek Server Management Alert:alpha\r\nCheck Fan 1 at server alpha\r\nEvent Type:Warning\r\n"
+         "Event Severity:Critical\r\nComponent:Baseboard\r\nGroup:Fan 1\r\nInstance:CPU 1\r\n"},
+        // A body line of one "." reaches the server as text, not as the end.
+        {"dot line", "Check x\n.\nafter the dot\n",
+         "SUBJECT:Zorek Server Management Alert:alpha\r\nCheck x\r\n.\r\nafter the dot\r\n"},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        char pattern[] = "/tmp/moxsmtpXXXXXX";
+        std::string folder = mkdtemp(pattern);
+        LoopbackServer server(folder);
+        ASSERT_NE(server.port(), 0) << "the loopback SMTP server did not start";
+
+        Alert alert("127.0.0.1", "mox@alpha.example", "ops@example.org;boss@example.org",
+                    "Zorek Server Management Alert:alpha", c.body);
+        Outcome out = runDialogue(alert, server.port());
+        // 1 means the data was answered with 250 and QUIT with 221.
+        EXPECT_EQ(out.result, 1);
+        EXPECT_EQ(out.standardError, "");
+        EXPECT_TRUE(LogCapture::take().empty());
+
+        EXPECT_EQ(readFile(folder + "/message1"),
+                  "MAIL FROM:mox@alpha.example\nRCPT TO:ops@example.org\nRCPT TO:boss@example.org\n\n" + c.stored);
+        struct stat info{};
+        EXPECT_NE(stat((folder + "/message2").c_str(), &info), 0) << "a second message was stored";
+        unlink((folder + "/message1").c_str());
+        rmdir(folder.c_str());
+    }
+}
+
+} // namespace
