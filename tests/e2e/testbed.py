@@ -366,6 +366,31 @@ exit 0
     def start_mox(self, extra_env=None):
         return self.spawn([require("MOX_BIN", "the mox daemon")], extra_env)
 
+    def dmictl(self, *args, check=True):
+        """Runs the provider's client tool inside the testbed: its standard
+        output, or (status, output, error) with check=False."""
+        tool = require("MOX_DMICTL", "the provider's client tool")
+        done = self.run([tool] + [str(a) for a in args])
+        out, err = done.stdout.decode(), done.stderr.decode()
+        if not check:
+            return done.returncode, out, err
+        if done.returncode != 0:
+            raise AssertionError("dmictl %s: status %d: %s%s" % (" ".join(map(str, args)), done.returncode, out, err))
+        return out
+
+    def component_id(self, name):
+        """The id of the installed component called `name`, or None."""
+        for line in self.dmictl("list").splitlines():
+            cid, _, cname = line.partition("\t")
+            if cname == name:
+                return int(cid)
+        return None
+
+    def table(self, component, group):
+        """The rows of a table group as dicts attribute id -> text."""
+        ids = [int(line.split("\t")[0]) for line in self.dmictl("attributes", component, group).splitlines()]
+        return [dict(zip(ids, line.split("\t"))) for line in self.dmictl("rows", component, group).splitlines()]
+
     def start_smtp(self, replies=None):
         if replies:
             self.write("smtp", "replies.json", json.dumps(replies))
