@@ -338,7 +338,7 @@ exit 0
             "DMISP_SOCKET": self.paths["dmisp_socket"],
             "UXDMIPATH": self.paths["mifs"],
         }
-        preload = piece("MOX_OBX_PRELOAD")
+        preload = self._preload()
         if preload:
             env["LD_PRELOAD"] = preload
         for key in ("ASAN_OPTIONS", "UBSAN_OPTIONS"):
@@ -347,6 +347,34 @@ exit 0
         if extra:
             env.update(extra)
         return env
+
+    def _preload(self):
+        """The LD_PRELOAD value that attaches the simulated OBX driver.
+
+        The library is i386, as the daemon is; the daemon's own children
+        (the shell of its mount commands) are native programs, which would
+        complain on standard error about a library of the wrong class. So the
+        path goes through ld.so's $LIB token: it names the simulated driver
+        for 32-bit programs and the C library, loaded by them anyway, for
+        64-bit ones."""
+        library = piece("MOX_OBX_PRELOAD")
+        if library is None:
+            return None
+        base = os.path.join(self.root, "preload")
+        if not os.path.isdir(base):
+            native_libc = None
+            with open("/proc/self/maps") as maps:
+                for line in maps:
+                    path = line.split()[-1]
+                    if os.path.basename(path).startswith("libc.so"):
+                        native_libc = path
+                        break
+            for lib, target in (("lib32", library), ("lib/i386-linux-gnu", library),
+                                ("lib/x86_64-linux-gnu", native_libc), ("lib64", native_libc)):
+                if target:
+                    os.makedirs(os.path.join(base, lib))
+                    os.symlink(target, os.path.join(base, lib, "libobxpreload.so"))
+        return base + "/$LIB/libobxpreload.so"
 
     def inside(self, args):
         return ["nsenter", "-t", str(self.holder.pid), "-m", "-n", "--wd=" + self.paths["work"], "--"] + list(args)
