@@ -337,6 +337,7 @@ exit 0
             "DMISP_DB": self.paths["db"],
             "DMISP_SOCKET": self.paths["dmisp_socket"],
             "UXDMIPATH": self.paths["mifs"],
+            "OBXSIM_LOG": os.path.join(self.root, "obx.log"),
         }
         preload = self._preload()
         if preload:
@@ -418,6 +419,26 @@ exit 0
         """The rows of a table group as dicts attribute id -> text."""
         ids = [int(line.split("\t")[0]) for line in self.dmictl("attributes", component, group).splitlines()]
         return [dict(zip(ids, line.split("\t"))) for line in self.dmictl("rows", component, group).splitlines()]
+
+    def start_kobd(self, *args):
+        """Starts the alarm peer under the program name "kobd", which the
+        daemon checks in its command line; None until it has made its FIFO."""
+        kobd = require("MOX_KOBD", "the alarm peer kobd")
+        process = self.spawn(["kobd"] + list(args), {"PATH": os.path.dirname(kobd) + ":/usr/bin:/bin"})
+        deadline = time.monotonic() + 10
+        while not os.path.exists(os.path.join(self.paths["run"], "kobLock")):
+            if time.monotonic() > deadline or not process.running():
+                raise RuntimeError("kobd did not start: %r" % process.stderr.data)
+            time.sleep(0.02)
+        return process
+
+    def obx_log(self):
+        """The simulated OBX driver's event log, one line per event."""
+        try:
+            with open(os.path.join(self.root, "obx.log")) as f:
+                return f.read().splitlines()
+        except FileNotFoundError:
+            return []
 
     def start_smtp(self, replies=None):
         if replies:
