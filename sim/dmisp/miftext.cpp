@@ -255,9 +255,10 @@ public:
             if (!advance() || !expectPunct("=") || !stringValue(&c.language))
                 return false;
         }
+        int startLine = tok_.line;
         if (!expectWord("start") || !expectWord("component"))
             return false;
-        if (!componentBody(&c))
+        if (!componentBody(&c, startLine))
             return false;
         if (tok_.kind != Token::End)
             return fail(tok_.line, "text after end component");
@@ -347,9 +348,8 @@ private:
         return advance();
     }
 
-    bool componentBody(Component* c)
+    bool componentBody(Component* c, int startLine)
     {
-        int startLine = tok_.line;
         bool haveName = false;
         for (;;) {
             bool done;
@@ -374,10 +374,10 @@ private:
                 if (!advance())
                     return false;
                 if (wordIs(tok_, "group")) {
-                    if (!advance() || !group())
+                    if (!advance() || !group(key.line))
                         return false;
                 } else if (wordIs(tok_, "table")) {
-                    if (!advance() || !table())
+                    if (!advance() || !table(key.line))
                         return false;
                 } else if (wordIs(tok_, "enum")) {
                     int line = tok_.line;
@@ -461,10 +461,10 @@ private:
         }
     }
 
-    bool group()
+    bool group(int startLine)
     {
         RawGroup rg;
-        rg.line = tok_.line;
+        rg.line = startLine;
         rg.order = order_++;
         std::vector<RawAttribute> attrs;
         bool haveName = false, haveClass = false;
@@ -519,7 +519,7 @@ private:
                 if (!wordIs(tok_, "attribute"))
                     return fail(tok_.line, "unknown block " + describe(tok_) + " in group");
                 RawAttribute ra;
-                ra.line = tok_.line;
+                ra.line = key.line;
                 if (!advance() || !attribute(&ra))
                     return false;
                 for (const RawAttribute& o : attrs)
@@ -773,10 +773,10 @@ private:
         return false;
     }
 
-    bool table()
+    bool table(int startLine)
     {
         RawTable t;
-        t.line = tok_.line;
+        t.line = startLine;
         t.order = order_++;
         bool haveClass = false;
         for (;;) {

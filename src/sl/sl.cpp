@@ -285,7 +285,8 @@ int SLSynchronousExecute(SLHandle* h)
 void* dmiConfirmFunc(void* commandBlock)
 {
     // The command block is the start of its handle.
-    pendingWord(static_cast<SLHandle*>(commandBlock)).store(0);
+    if (commandBlock != nullptr)
+        pendingWord(static_cast<SLHandle*>(commandBlock)).store(0);
     return commandBlock;
 }
 
