@@ -8,7 +8,7 @@ and RCPT, 354 to DATA, 250 after the end of data, 221 to QUIT. Nothing is
 answered between DATA and the end of data, as a real server does. Each
 session is written to DIRECTORY/session-N.json once the client has closed
 the connection: the commands and data bytes received, in order, as text with
-the bytes kept exactly (latin-1). "DIRECTORY/ready" appears once listening.
+the bytes kept exactly (latin-1), each with its CLOCK_MONOTONIC arrival time. "DIRECTORY/ready" appears once listening.
 A file DIRECTORY/replies.json may override the reply to a stage, e.g.
 {"greeting": "421 busy"}.
 """
@@ -18,6 +18,7 @@ import os
 import socket
 import sys
 import threading
+import time
 
 
 def serve(conn, directory, number, replies):
@@ -26,7 +27,7 @@ def serve(conn, directory, number, replies):
 
     def reply(stage, default):
         text = replies.get(stage, default)
-        record["commands"].append({"sent": text})
+        record["commands"].append({"sent": text, "at": time.monotonic()})
         conn.sendall(text.encode("latin-1") + b"\r\n")
 
     try:
@@ -52,7 +53,7 @@ def serve(conn, directory, number, replies):
                     break
                 line = buffer[:end].decode("latin-1")
                 buffer = buffer[end + 2:]
-                record["commands"].append({"received": line})
+                record["commands"].append({"received": line, "at": time.monotonic()})
                 verb = line.split(" ", 1)[0].split(":", 1)[0].upper()
                 if verb in ("HELO", "EHLO"):
                     reply("helo", "250 testbed")

@@ -123,6 +123,16 @@ class SyslogReceiver:
         with self.cond:
             return [e for e in self.entries if tag is None or e.tag == tag]
 
+    def mark(self):
+        """A position in the log, for since() and wait_for(start=...)."""
+        with self.cond:
+            return len(self.entries)
+
+    def since(self, start, tag="mox"):
+        """The entries from position `start` on, of one tag (None: all)."""
+        with self.cond:
+            return [e for e in self.entries[start:] if tag is None or e.tag == tag]
+
     def wait_for(self, message, timeout, tag="mox", start=0):
         """The first entry from `start` on whose message equals `message` (a
         string) or satisfies it (a callable); None when none came in time."""
