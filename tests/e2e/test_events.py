@@ -101,6 +101,7 @@ class EventTest(BedTestCase):
         peer = bed.start_kobd() if kobd else None
         mox = bed.start_mox()
         self.assertLogged(bed, INSTALLED, LOG_INFO)
+        self.assertTrue(bed.wait_registered(), "start-up did not settle: %r" % mox.stderr.data)
         ids["mox"] = bed.component_id(MOX_COMPONENT)
         return bed, mox, ids, peer
 

@@ -417,6 +417,27 @@ exit 0
             raise AssertionError("dmictl %s: status %d: %s%s" % (" ".join(map(str, args)), done.returncode, out, err))
         return out
 
+    def wait_registered(self, timeout=20, quiet=0.5):
+        """Waits until the daemon has registered with the provider and its
+        start-up has finished: its last start-up step, the event worker,
+        leaves no trace of its own, so the sign is that the provider has
+        counted no further command for `quiet` seconds after the
+        registration. True when that came in time."""
+        deadline = time.monotonic() + timeout
+        last, since = None, None
+        while time.monotonic() < deadline:
+            code, out, _ = self.dmictl("status", check=False)
+            fields = dict(line.split("\t", 1) for line in out.splitlines() if "\t" in line) if code == 0 else {}
+            if fields.get("registrations") == "1":
+                commands = fields.get("commands")
+                now = time.monotonic()
+                if commands != last:
+                    last, since = commands, now
+                elif now - since >= quiet:
+                    return True
+            time.sleep(0.1)
+        return False
+
     def component_id(self, name):
         """The id of the installed component called `name`, or None."""
         for line in self.dmictl("list").splitlines():
