@@ -874,6 +874,7 @@ private:
             if (!t.name.empty())
                 g.name = t.name;
             g.rows.clear();
+            g.rowIndex.clear();
             if (g.keys.empty() && t.rows.size() != 1)
                 return fail(t.line, "table of a group without keys must have exactly one row");
             for (size_t r = 0; r < t.rows.size(); ++r) {
@@ -889,9 +890,9 @@ private:
                         return false;
                     row.push_back(v);
                 }
-                g.rows.push_back(std::move(row));
-                if (!g.reindex())
+                if (!g.keys.empty() && !g.rowIndex.emplace(keyIndexOf(g, row), g.rows.size()).second)
                     return fail(t.rowLines[r], "row has the same key values as an earlier row");
+                g.rows.push_back(std::move(row));
             }
             fromTables.push_back(std::move(g));
             tableLines.push_back(t.hasId ? t.idLine : t.line);
