@@ -1,13 +1,20 @@
-// Timed driver for the SL command path against an in-process scripted
-// provider: get-row-by-keys commands per second (completed inline in the
-// entry point, and completed from a provider thread), and the cost of one
-// name lookup over 20 components.
+// Timed driver for the SL command path: get-row-by-keys commands per second
+// against an in-process scripted provider (completed inline in the entry
+// point, and completed from a provider thread) and, when it is built, the
+// substitute provider; and the cost of one name lookup over 20 components.
 #include <atomic>
 #include <chrono>
 #include <cstdio>
 #include <cstring>
 #include <string>
 #include <thread>
+
+#ifdef MOX_HAVE_DMISP
+#include <cstdlib>
+#include <unistd.h>
+
+#include "dmisp/dmisp.h"
+#endif
 
 #include "sl/sl.h"
 #include "sl/slaccess.h"
@@ -140,6 +147,60 @@ double lookupMicroseconds(double seconds)
     return elapsed * 1e6 / lookups;
 }
 
+#ifdef MOX_HAVE_DMISP
+// Get-row by keys against the substitute provider: a table of 20 rows.
+double substituteProviderRate(double seconds)
+{
+    char directory[] = "/tmp/sl-bench-XXXXXX";
+    if (mkdtemp(directory) == nullptr)
+        return 0;
+    std::string mif = "start component\n  name = \"Bench\"\n"
+                      "  start group\n    name = \"Table\"  class = \"Zorek|Table|001\"  key = 1\n"
+                      "    start attribute name = \"Index\" id = 1 type = integer end attribute\n"
+                      "    start attribute name = \"Reading\" id = 2 type = integer value = 42 end attribute\n"
+                      "  end group\n  start table\n    name = \"Table\"  class = \"Zorek|Table|001\"  id = 10\n";
+    for (int i = 1; i <= 20; ++i)
+        mif += "    {" + std::to_string(i) + ", 42}\n";
+    mif += "  end table\nend component\n";
+    std::string error;
+    uint32_t component = 0;
+    if (dmisp::reset(directory, false, &error) == 0)
+        component = dmisp::installText(mif, "bench.mif", &error);
+    double rate = 0;
+    SLDmiInvoke = DmiInvoke;
+    SLHandle* h = SLCreateHandle(0);
+    if (component != 0 && SLDmiRegisterMgmt(h, nullptr) == 0) {
+        SLKeyList* keys = oneKey();
+        long commands = 0;
+        auto start = Clock::now();
+        auto end = start + std::chrono::duration<double>(seconds);
+        while (Clock::now() < end && rate >= 0) {
+            for (int i = 0; i < 64; ++i) {
+                storeWord(keys->keys[0].value, 1 + (commands + i) % 20);
+                if (SLGetRow(h, component, 10, 0, keys) != 0 || SLRowUnsignedValue(h, 1) != 42) {
+                    std::fprintf(stderr, "get-row failed: status %u\n", SLCnfStatus(h));
+                    rate = -1;
+                    break;
+                }
+            }
+            commands += 64;
+        }
+        if (rate == 0)
+            rate = commands / std::chrono::duration<double>(Clock::now() - start).count();
+        SLDmiUnregisterMgmt(h);
+        SLDeleteKeyList(keys);
+    } else {
+        std::fprintf(stderr, "substitute provider not usable: %s\n", error.c_str());
+    }
+    SLDestroyHandle(h);
+    dmisp::shutdown();
+    std::string remove = std::string("rm -rf '") + directory + "'";
+    if (std::system(remove.c_str()) != 0)
+        std::fprintf(stderr, "cannot remove %s\n", directory);
+    return rate > 0 ? rate : 0;
+}
+#endif
+
 } // namespace
 
 int main(int argc, char** argv)
@@ -155,6 +216,13 @@ int main(int argc, char** argv)
     stopping = true;
     provider.join();
     std::printf("get-row by keys, confirm from a thread:     %10.0f commands/s\n", threadedRate);
+
+#ifdef MOX_HAVE_DMISP
+    double substituteRate = substituteProviderRate(seconds);
+    std::printf("get-row by keys, substitute provider:       %10.0f commands/s\n", substituteRate);
+    if (substituteRate <= 0)
+        return 1;
+#endif
 
     double lookup = lookupMicroseconds(seconds);
     std::printf("name lookup, match at the 20th component:   %10.2f us (%.2f us per command)\n", lookup,
