@@ -15,6 +15,7 @@ protected:
     {
         ProviderTest::SetUp();
         component = install(testComponentMif());
+        registerManagement();
         componentList = newComponentInfo(component);
         ASSERT_NE(componentList, nullptr);
     }
@@ -78,19 +79,59 @@ TEST_F(Catalogue, UnknownIdsGiveFallbacksWithoutCommands)
     EXPECT_GT(dmisp::commandsReceived(), before);
 }
 
+// Answers the listing of attribute 99 itself, with an enumeration that the
+// provider's MIF reader would refuse: value 1 listed twice.
+uint32_t duplicateEnumeration(void* block)
+{
+    if (loadWordAt(block, 1) != 520 || loadWordAt(block, 18) != 99)
+        return DmiInvoke(block);
+    auto* confirm = static_cast<uint8_t*>(wordPointer(loadWordAt(block, 8)));
+    const struct {
+        int32_t value;
+        const char* text;
+    } entries[] = {{0, "Off"}, {1, "On"}, {1, "Running"}, {2, "Failed"}};
+    const uint32_t count = 4;
+    uint32_t offset = 7 * 4 + 8 * count; // the entry, then the enumeration list
+    auto putString = [&](const char* text) {
+        uint32_t at = offset;
+        storeWord(confirm + at, static_cast<uint32_t>(strlen(text)));
+        memcpy(confirm + at + 4, text, strlen(text));
+        offset += 4 + static_cast<uint32_t>(strlen(text));
+        return at;
+    };
+    // Attribute entry: id, name, access, type, maximum size, enumeration count and list.
+    const uint32_t words[] = {99, putString("Duplicated"), 1, 5, 4, count, 28};
+    for (uint32_t i = 0; i < 7; ++i)
+        storeWordAt(confirm, i, words[i]);
+    for (uint32_t i = 0; i < count; ++i) {
+        storeWordAt(confirm + 28, 2 * i, static_cast<uint32_t>(entries[i].value));
+        storeWordAt(confirm + 28, 2 * i + 1, putString(entries[i].text));
+    }
+    storeWordAt(block, 10, 1);
+    storeWordAt(block, 11, 0);
+    dmiConfirmFunc(block);
+    return 0;
+}
+
 TEST_F(Catalogue, DuplicateEnumerationValueGivesTheLaterText)
 {
-    EXPECT_STREQ(AttributeEnumerationString(h, component, 1, 2, 0), "Off");
-    EXPECT_STREQ(AttributeEnumerationString(h, component, 1, 2, 1), "Running");
-    EXPECT_STREQ(AttributeEnumerationString(h, component, 1, 2, 2), "Failed");
-    EXPECT_EQ(AttributeEnumerationString(h, component, 1, 2, 3), nullptr);
-    AttributeInfo* a = pAttributeInfo(h, component, 1, 2);
+    ASSERT_STREQ(GroupName(h, component, 1), "Scalars");
+    SLDmiInvoke = duplicateEnumeration;
+    EXPECT_STREQ(AttributeName(h, component, 1, 99), "Duplicated");
+    SLDmiInvoke = DmiInvoke;
+    EXPECT_STREQ(AttributeEnumerationString(h, component, 1, 99, 0), "Off");
+    EXPECT_STREQ(AttributeEnumerationString(h, component, 1, 99, 1), "Running");
+    EXPECT_STREQ(AttributeEnumerationString(h, component, 1, 99, 2), "Failed");
+    EXPECT_EQ(AttributeEnumerationString(h, component, 1, 99, 3), nullptr);
+    AttributeInfo* a = pAttributeInfo(h, component, 1, 99);
     ASSERT_NE(a, nullptr);
     EXPECT_EQ(a->enumCount, 4u);
-    // Reverse listing order.
-    EnumList* e = AttributeEnumList(h, component, 1, 2);
+    EnumList* e = AttributeEnumList(h, component, 1, 99);
     ASSERT_NE(e, nullptr);
-    EXPECT_STREQ(e->name, "Failed");
+    EXPECT_STREQ(e->name, "Failed") << "reverse listing order";
+
+    // From the provider's own listing.
+    EXPECT_STREQ(AttributeEnumerationString(h, component, 1, 2, 1), "On");
     EXPECT_EQ(AttributeEnumList(h, component, 1, 1), nullptr) << "plain integer";
 }
 

@@ -17,6 +17,7 @@ protected:
     {
         ProviderTest::SetUp();
         component = install(testComponentMif());
+        registerManagement();
         componentList = newComponentInfo(component);
         ASSERT_NE(componentList, nullptr);
     }
@@ -65,9 +66,8 @@ TEST_F(Formatting, ValuesAsTextCutToTheBuffer)
         {"unsupported len 5", 1, "-2147483648", 5, "Unsu", 0},
         {"unsupported len 1", 1, "-2147483648", 1, "", 0},
         {"enumeration", 2, nullptr, 64, "Off", 3},
-        {"enumeration duplicate", 2, "1", 64, "Running", 7},
-        {"enumeration len 5", 2, "1", 5, "Runn", 4},
-        {"value outside the enumeration", 2, "5", 64, "5", 1},
+        {"enumeration other entry", 2, "1", 64, "On", 2},
+        {"enumeration len 5", 2, "2", 5, "Fail", 4},
         {"counter", 5, nullptr, 64, "7", 1},
         {"gauge", 6, nullptr, 64, "99", 2},
         {"string", 3, nullptr, 64, "plain text", 10},
@@ -113,7 +113,7 @@ TEST_F(Formatting, SetsByType)
         std::string stored; // as the provider gives it back
     } cases[] = {
         {"enumeration text", 2, "Failed", 1, "2"},
-        {"enumeration duplicate", 2, "Running", 1, "1"},
+        {"enumeration other entry", 2, "On", 1, "1"},
         {"enumeration in other case", 2, "failed", 0, "1"},
         {"text outside the enumeration", 2, "Broken", 0, "1"},
         {"plain integer", 1, "123", 1, "123"},

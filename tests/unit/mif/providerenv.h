@@ -26,6 +26,14 @@ class ProviderTest : public ::testing::Test {
 protected:
     std::string dir;
     SLHandle* h = nullptr;
+    bool managementRegistered = false;
+
+    // Commands are confirmed only to a registered management application.
+    void registerManagement()
+    {
+        ASSERT_EQ(SLDmiRegisterMgmt(h, [](SLHandle*) { return 0; }), 0);
+        managementRegistered = true;
+    }
 
     void SetUp() override
     {
@@ -50,6 +58,8 @@ protected:
         SLDmiInvoke = DmiInvoke;
         dmisp::clearFaults();
         UnregisterWithSL();
+        if (managementRegistered)
+            SLDmiUnregisterMgmt(h);
         SLDestroyHandle(h);
         moxSetLogHook(nullptr);
         dmisp::shutdown();

@@ -88,10 +88,28 @@ TEST_F(Registration, CataloguesSupportedComponents)
     EXPECT_EQ(entries, 2) << "the own component and the baseboard";
 
     // Installed again while the daemon runs: a second entry, the first answers.
-    AddComponentToList(NewDmiString("Zorek Tessarin Baseboard"), 4242); // leaks one SL string: fine in a test
+    DmiString* name = NewDmiString("Zorek Tessarin Baseboard");
+    AddComponentToList(name, 4242);
+    SLDeleteString(name);
     EXPECT_EQ(GetComponentId(1), baseboard);
     ASSERT_NE(componentList->next->next, nullptr);
     EXPECT_EQ(componentList->next->next->componentId, 4242u);
+}
+
+// Makes the first component listing of the supported-components walk (the
+// first one after the own entry was named) answer with status 512.
+bool entryNamed = false;
+bool warned = false;
+uint32_t warnFirstWalkStep(void* block)
+{
+    uint32_t code = loadWordAt(block, 1);
+    if (code == 512)
+        entryNamed = true;
+    else if (code == 514 && entryNamed && !warned) {
+        warned = true;
+        dmisp::injectListingStatus512(1);
+    }
+    return DmiInvoke(block);
 }
 
 TEST_F(Registration, ListingWithStatus512StillAddsTheComponent)
@@ -99,11 +117,11 @@ TEST_F(Registration, ListingWithStatus512StillAddsTheComponent)
     std::string error;
     uint32_t baseboard = dmisp::install(MOX_SOURCE_DIR "/mifs/baseboard.mif", &error);
     ASSERT_NE(baseboard, 0u) << error;
-    ASSERT_EQ(RegisterWithSL(), 0); // installs mox.mif
-    UnregisterWithSL();
-    dmisp::injectListingStatus512(20);
+    entryNamed = warned = false;
+    SLDmiInvoke = warnFirstWalkStep;
     ASSERT_EQ(RegisterWithSL(), 0);
-    EXPECT_EQ(BaseboardComponentId(), baseboard);
+    EXPECT_TRUE(warned);
+    EXPECT_EQ(BaseboardComponentId(), baseboard) << "listed first, with status 512";
 }
 
 // A provider that answers the listing after `staleAfter` with status 512 and
@@ -177,6 +195,15 @@ TEST_F(SupportedRows, NameMustMatchExactly)
     add("Zorek Tessarin Baseboard", 905);
     EXPECT_EQ(GetMifId(905), 1u);
     EXPECT_EQ(entries(), 3u);
+}
+
+TEST_F(SupportedRows, RowWithoutNameEndsTheSearch)
+{
+    start({"1, \"Zorek Tessarin Baseboard\"", "3, unknown", "7, \"Storage Shelf\""});
+    add("Storage Shelf", 900);
+    EXPECT_EQ(entries(), 1u) << "rows behind a nameless row are not reached";
+    add("Zorek Tessarin Baseboard", 901);
+    EXPECT_EQ(GetMifId(901), 1u);
 }
 
 TEST_F(SupportedRows, EmptyTableSupportsNothing)

@@ -25,7 +25,6 @@ inline const char* testComponentMif()
             type = start enum
                 0 = "Off"
                 1 = "On"
-                1 = "Running"
                 2 = "Failed"
             end enum
             access = read-write
