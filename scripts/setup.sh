@@ -3,7 +3,12 @@
 # on an x86-64 host). Installs nothing when everything is already present.
 set -euo pipefail
 
-packages=(cmake g++ g++-multilib lib32asan8 lib32ubsan1 googletest file
+# python3-aiosmtpd and postfix: the loopback SMTP servers that the e-mail
+# delivery tests talk to (postfix is installed unconfigured, so no system mail
+# service is set up or started; the tests run a private instance).
+# python3, util-linux (unshare, nsenter), bsdutils (logger) and iproute2: the
+# end-to-end testbed.
+packages=(cmake g++ g++-multilib lib32asan8 lib32ubsan1 googletest file python3-aiosmtpd postfix
   python3 util-linux bsdutils iproute2)
 
 missing=()
@@ -17,5 +22,6 @@ if [ ${#missing[@]} -gt 0 ]; then
     exit 1
   fi
   apt-get update -qq
+  echo "postfix postfix/main_mailer_type select No configuration" | debconf-set-selections
   DEBIAN_FRONTEND=noninteractive apt-get install -y -qq "${missing[@]}" >/dev/null
 fi

@@ -97,12 +97,21 @@ int fail(Dialogue& d, int errorClass, int step, int value, const char* format)
     return 0;
 }
 
+// Appends a terminated text to the command, cut to fit.
+size_t appendText(Dialogue& d, size_t n, const char* text)
+{
+    while (*text != '\0' && n + 1 < sizeof d.command)
+        d.command[n++] = *text++;
+    d.command[n] = '\0';
+    return n;
+}
+
+// Builds prefix, the sanitised text (at most maxLength bytes) and suffix.
 void setCommand(Dialogue& d, const char* prefix, const char* text, size_t maxLength, const char* suffix)
 {
-    size_t n = snprintf(d.command, sizeof d.command, "%s", prefix);
+    size_t n = appendText(d, 0, prefix);
     n += smtpCopySanitized(d.command + n, sizeof d.command - n, text, maxLength);
-    n += snprintf(d.command + n, sizeof d.command - n, "%s", suffix);
-    d.commandLength = n < sizeof d.command ? n : sizeof d.command - 1;
+    d.commandLength = appendText(d, n, suffix);
 }
 
 struct Stage {

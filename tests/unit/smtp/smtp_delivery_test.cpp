@@ -1,11 +1,15 @@
-// Delivers alerts to a real SMTP server (python3-aiosmtpd from Debian's
-// packages) started on loopback, and reads back what it stored.
+// Delivers alerts to real SMTP servers from Debian's packages started on
+// loopback (python3-aiosmtpd, and a private postfix instance), and reads back
+// what they stored.
 #include <gtest/gtest.h>
 
 #include <csignal>
 #include <fstream>
 #include <poll.h>
 #include <sstream>
+#include <arpa/inet.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -105,6 +109,110 @@ TEST_F(SmtpDelivery, AlertIsStoredByARealServer)
         unlink((folder + "/message1").c_str());
         rmdir(folder.c_str());
     }
+}
+
+// The MTA that refuses the bare line feeds of an alert body and takes the
+// second "." of a doubled terminator for a command. The alert must be
+// accepted (250 after the data, 221 for QUIT) and held in its queue whole.
+std::string commandOutput(const std::string& command)
+{
+    std::string text;
+    FILE* pipe = popen(command.c_str(), "r");
+    if (pipe == nullptr)
+        return text;
+    char buffer[4096];
+    size_t n;
+    while ((n = fread(buffer, 1, sizeof buffer, pipe)) > 0)
+        text.append(buffer, n);
+    pclose(pipe);
+    return text;
+}
+
+uint16_t freeLoopbackPort()
+{
+    int s = socket(AF_INET, SOCK_STREAM, 0);
+    sockaddr_in address{};
+    address.sin_family = AF_INET;
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    bind(s, reinterpret_cast<sockaddr*>(&address), sizeof address);
+    socklen_t length = sizeof address;
+    getsockname(s, reinterpret_cast<sockaddr*>(&address), &length);
+    close(s);
+    return ntohs(address.sin_port);
+}
+
+bool acceptsConnections(uint16_t port)
+{
+    int s = socket(AF_INET, SOCK_STREAM, 0);
+    sockaddr_in address{};
+    address.sin_family = AF_INET;
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    address.sin_port = htons(port);
+    bool ok = connect(s, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0;
+    close(s);
+    return ok;
+}
+
+TEST_F(SmtpDelivery, AlertIsAcceptedAndHeldByPostfix)
+{
+    struct stat info{};
+    if (stat("/usr/sbin/postfix", &info) != 0)
+        GTEST_SKIP() << "postfix is not installed: the delivery to a real MTA is not checked";
+    if (geteuid() != 0)
+        GTEST_SKIP() << "a private postfix instance needs root: the delivery to a real MTA is not checked";
+
+    char pattern[] = "/tmp/moxpostfixXXXXXX";
+    std::string folder = mkdtemp(pattern);
+    chmod(folder.c_str(), 0755);
+    uint16_t port = freeLoopbackPort();
+    pid_t instance = fork();
+    if (instance == 0) {
+        std::string log = folder + "/log";
+        FILE* out = freopen(log.c_str(), "w", stdout);
+        (void)out;
+        execl("/bin/bash", "bash", MOX_POSTFIX_SCRIPT, folder.c_str(), std::to_string(port).c_str(),
+              static_cast<char*>(nullptr));
+        _exit(127);
+    }
+    bool up = false;
+    for (int i = 0; i < 150 && !up; i++) {
+        up = acceptsConnections(port);
+        if (!up)
+            usleep(100000);
+    }
+
+    Outcome out{};
+    std::string held;
+    if (up) {
+        Alert alert("127.0.0.1", "mox@alpha.example", "ops@example.org;boss@example.org",
+                    "Zorek Server Management Alert:alpha",
+                    "Check Fan 1 at server alpha\nEvent Type:Warning\nInstance:CPU 1\n");
+        out = runDialogue(alert, port);
+        // The held queue file, envelope and content, as postcat shows it.
+        std::string etc = folder + "/etc";
+        for (int i = 0; i < 50 && held.find("Instance:CPU 1") == std::string::npos; i++) {
+            held = commandOutput("for f in " + folder + "/queue/hold/*; do [ -f \"$f\" ] && /usr/sbin/postcat -c " + etc +
+                                 " -e -h -b \"$f\"; done 2>/dev/null");
+            if (held.find("Instance:CPU 1") == std::string::npos)
+                usleep(100000);
+        }
+    }
+    commandOutput("/usr/sbin/postfix -c " + folder + "/etc stop 2>&1");
+    waitpid(instance, nullptr, 0);
+    std::string log = readFile(folder + "/log");
+    commandOutput("rm -rf " + folder);
+
+    ASSERT_TRUE(up) << "postfix did not start:\n" << log;
+    EXPECT_EQ(out.result, 1) << log;
+    EXPECT_EQ(out.standardError, "");
+    EXPECT_TRUE(LogCapture::take().empty());
+    EXPECT_EQ(log.find("non-SMTP command"), std::string::npos) << log;
+    EXPECT_NE(held.find("sender: mox@alpha.example\n"), std::string::npos) << held;
+    EXPECT_NE(held.find("recipient: ops@example.org\n"), std::string::npos) << held;
+    EXPECT_NE(held.find("recipient: boss@example.org\n"), std::string::npos) << held;
+    EXPECT_NE(held.find("SUBJECT:Zorek Server Management Alert:alpha\n"), std::string::npos) << held;
+    EXPECT_NE(held.find("\nCheck Fan 1 at server alpha\nEvent Type:Warning\nInstance:CPU 1\n"), std::string::npos)
+        << held;
 }
 
 } // namespace
