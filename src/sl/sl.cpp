@@ -12,11 +12,6 @@
 #include "sl/slhandle.h"
 #include "sl/slstring.h"
 
-// The provider's entry point is referenced weakly: a daemon built without a
-// provider library still links, and then finds no entry point at start-up, so
-// every command fails with 1 as in an uninitialised library.
-extern "C" uint32_t DmiInvoke(void* commandBlock) __attribute__((weak));
-
 SLInvokeFunction SLDmiInvoke = nullptr;
 std::atomic<int> SLLibDownFlag{0};
 

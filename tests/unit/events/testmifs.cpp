@@ -33,14 +33,14 @@ std::string ownMif(const std::string& standardRows, const std::string& vendorRow
            intAttribute(1, "MIF Id") +
            "start attribute\n name = \"Component\"\n id = 2\n type = displaystring(64)\n value = \"\"\nend attribute\n"
            "end group\n"
-           "start table\n name = \"Supported Table\"\n class = \"Zorek|Mox Supported Components|001\"\n id = 2\n"
+           "start table\n name = \"Supported\"\n class = \"Zorek|Mox Supported Components|001\"\n id = 2\n"
            " { 1, \"Test Board\" }\n { 2, \"Other Board\" }\nend table\n"
            "start group\n name = \"Vendor Actions\"\n class = \"Zorek|Mox Vendor Event Actions|001\"\n id = 4\n"
            " key = 1,2,3,4,5,6\n" +
            intAttribute(1, "MIF") + intAttribute(2, "Group") + intAttribute(3, "Instance") + intAttribute(4, "Attribute") +
            intAttribute(5, "Value") + intAttribute(6, "State") + actionAttributes(n) +
            "end group\n"
-           "start table\n name = \"Vendor Table\"\n class = \"Zorek|Mox Vendor Event Actions|001\"\n id = 4\n" +
+           "start table\n name = \"Vendor Actions\"\n class = \"Zorek|Mox Vendor Event Actions|001\"\n id = 4\n" +
            vendorRows +
            "end table\n"
            "start group\n name = \"Standard Actions\"\n class = \"Zorek|Mox Standard Event Actions|001\"\n id = 10\n"
@@ -49,7 +49,7 @@ std::string ownMif(const std::string& standardRows, const std::string& vendorRow
            intAttribute(5, "Zero") + intAttribute(6, "Severity") + actionAttributes(n) + intAttribute(31, "System") +
            intAttribute(32, "Subsystem") +
            "end group\n"
-           "start table\n name = \"Standard Table\"\n class = \"Zorek|Mox Standard Event Actions|001\"\n id = 10\n" +
+           "start table\n name = \"Standard Actions\"\n class = \"Zorek|Mox Standard Event Actions|001\"\n id = 10\n" +
            standardRows + "end table\nend component\n";
 }
 
@@ -75,7 +75,7 @@ std::string boardMif(const std::string& name)
            "start attribute\n name = \"Solution\"\n id = 8\n type = integer\n value = 0\nend attribute\n"
            "start attribute\n name = \"Instance Data Present\"\n id = 9\n type = integer\n value = 1\nend attribute\n"
            "end group\n"
-           "start table\n name = \"Voltage Events\"\n class = \"EventGeneration|Voltage Probe|001\"\n id = 20\n"
+           "start table\n name = \"Voltage Event Generation\"\n class = \"EventGeneration|Voltage Probe|001\"\n id = 20\n"
            " { 4, 0x08, 1, 0, \"Zorek|Voltage Probe|001\", 1, 2, 0, 1 }\n"
            " { 4, 0x10, 1, 0, \"Zorek|Voltage Probe|001\", 1, 2, 0, 1 }\n"
            " { 4, 0x04, 1, 0, \"Zorek|Voltage Probe|001\", 1, 2, 0, 1 }\n"
@@ -93,17 +93,17 @@ std::string boardMif(const std::string& name)
            "start group\n name = \"Voltage Probe\"\n class = \"Zorek|Voltage Probe|001\"\n id = 3\n key = 1\n"
            "start attribute\n name = \"Index\"\n id = 1\n type = integer\n value = 0\nend attribute\n"
            "start attribute\n name = \"Short Name\"\n id = 2\n type = displaystring(32)\n value = \"\"\nend attribute\n"
-           "start attribute\n name = \"Reading\"\n id = 3\n type = start enum\n 1 = \"Too High\"\n end enum\n"
+           "start attribute\n name = \"Reading\"\n id = 3\n type = start enum\n 0 = \"Normal\"\n 1 = \"Too High\"\n end enum\n"
            " value = 0\nend attribute\n"
            "end group\n"
-           "start table\n name = \"Voltage Probes\"\n class = \"Zorek|Voltage Probe|001\"\n id = 3\n"
+           "start table\n name = \"Voltage Probe\"\n class = \"Zorek|Voltage Probe|001\"\n id = 3\n"
            " { 1, \"CPU Core\", 1 }\n { 2, \"3.3V\", 0 }\n { 7, \"\", 0 }\nend table\n"
            // a table without a name attribute
            "start group\n name = \"Fan\"\n class = \"Zorek|Fan|001\"\n id = 5\n key = 1\n"
            "start attribute\n name = \"Index\"\n id = 1\n type = integer\n value = 0\nend attribute\n"
            "start attribute\n name = \"Speed\"\n id = 2\n type = integer\n value = 0\nend attribute\n"
            "end group\n"
-           "start table\n name = \"Fans\"\n class = \"Zorek|Fan|001\"\n id = 5\n { 4, 1200 }\nend table\n"
+           "start table\n name = \"Fan\"\n class = \"Zorek|Fan|001\"\n id = 5\n { 4, 1200 }\nend table\n"
            // vendor error group: first attribute the error state
            "start group\n name = \"Board Errors\"\n class = \"Zorek|Error|001\"\n id = 30\n"
            "start attribute\n name = \"Error State\"\n id = 1\n type = start enum\n 0 = \"OK\"\n"
