@@ -243,7 +243,11 @@ class Process:
 
 
 class Testbed:
-    def __init__(self, name="bed", mifs=True):
+    def __init__(self, name="bed", mifs=True, binds=(), unset=()):
+        """`binds`: further [source, path] pairs laid over the namespace;
+        `unset`: variables of the daemon's environment to leave out."""
+        self.extra_binds = [list(b) for b in binds]
+        self.unset = list(unset)
         self.root = tempfile.mkdtemp(prefix="moxe2e-%s." % name)
         self.paths = {}
         for part in ("work", "cfg", "run", "floppy", "stubs", "db", "smtp", "scratch", "ns"):
@@ -325,7 +329,7 @@ exit 0
                 [self.paths["run"], "/var/run"],
                 [self.paths["floppy"], "/mnt/floppy"],
                 [init_stub, "/sbin/init"],
-            ],
+            ] + self.extra_binds,
         }
         config_path = os.path.join(self.root, "ns.json")
         with open(config_path, "w") as f:
@@ -357,6 +361,8 @@ exit 0
                 env[key] = os.environ[key]
         if extra:
             env.update(extra)
+        for key in self.unset:
+            env.pop(key, None)
         return env
 
     def _preload(self):
