@@ -6,10 +6,10 @@ set -euo pipefail
 # python3-aiosmtpd and postfix: the loopback SMTP servers that the e-mail
 # delivery tests talk to (postfix is installed unconfigured, so no system mail
 # service is set up or started; the tests run a private instance).
-# python3, util-linux (unshare, nsenter), bsdutils (logger) and iproute2: the
-# end-to-end testbed.
+# python3, util-linux (unshare, nsenter), mount, bsdutils (logger) and
+# iproute2: the end-to-end testbed; groff-base: its check of the man page.
 packages=(cmake g++ g++-multilib lib32asan8 lib32ubsan1 googletest file python3-aiosmtpd postfix
-  python3 util-linux bsdutils iproute2)
+  python3 util-linux mount bsdutils iproute2 groff-base)
 
 missing=()
 for p in "${packages[@]}"; do

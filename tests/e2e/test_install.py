@@ -68,14 +68,14 @@ class InstallTest(BedTestCase):
         self.assertEqual(unit["Install"]["WantedBy"], "multi-user.target")
 
         groff = shutil.which("groff")
-        if groff:
-            page = subprocess.run([groff, "-man", "-Tutf8", "-ww", os.path.join(destdir, "usr/share/man/man8/mox.8")],
-                                  capture_output=True)
-            self.assertEqual(page.stderr, b"", "man page warnings")
-            text = re.sub(".\x08", "", page.stdout.decode())  # bold and underline by overstriking
-            for section in ("NAME", "SYNOPSIS", "MARKER FILES", "CONFIGURATION", "ACTIONS TABLES", "SIGNALS",
-                            "EXIT STATUS", "FILES", "ENVIRONMENT"):
-                self.assertIn("\n" + section + "\n", text, section)
+        self.assertIsNotNone(groff, "groff (groff-base) is needed to check the man page")
+        page = subprocess.run([groff, "-man", "-Tutf8", "-ww", os.path.join(destdir, "usr/share/man/man8/mox.8")],
+                              capture_output=True)
+        self.assertEqual(page.stderr, b"", "man page warnings")
+        text = re.sub(".\x08", "", page.stdout.decode())  # bold and underline by overstriking
+        for section in ("NAME", "SYNOPSIS", "MARKER FILES", "CONFIGURATION", "ACTIONS TABLES", "SIGNALS",
+                        "EXIT STATUS", "FILES", "ENVIRONMENT"):
+            self.assertIn("\n" + section + "\n", text, section)
 
     def test_installed_daemon_runs_from_its_layout(self):
         # The installed daemon finds its provider library beside it and
