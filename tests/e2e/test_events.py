@@ -12,6 +12,7 @@ import tempfile
 import threading
 import time
 
+import testbed
 from testbed import LOG_EMERG, LOG_ERR, LOG_INFO, LOG_WARNING, BedTestCase, require, run_in_parallel
 
 MOX_COMPONENT = "Zorek Tessarin Server Manager - Mox"
@@ -205,8 +206,9 @@ class EventTest(BedTestCase):
             time.sleep(4.0)  # longer than the reset's 3 s wait
             self.assertTrue(mox.running(), "status %s" % mox.status)
             self.assertEqual(mox.stderr.data, TEMPERATURE_CONSOLE)
-            self.assertEqual([l for l in bed.obx_log() if not l.startswith(("open", "get device id"))], [],
-                             "requests reached the simulated driver")
+            if testbed.piece("MOX_OBX_PRELOAD"):
+                self.assertEqual([l for l in bed.obx_log() if not l.startswith(("open", "get device id"))], [],
+                                 "requests reached the simulated driver")
             self.assertFalse(os.path.exists(os.path.join(bed.paths["run"], "init.record")))
 
         def os_shutdown():

@@ -57,7 +57,8 @@ def piece(name):
 def require(name, what):
     path = piece(name)
     if path is None:
-        raise unittest.SkipTest("%s is not built (%s unset)" % (what, name))
+        raise unittest.SkipTest("%s is not available (%s unset: not built, or left out of a sanitizer build)"
+                                % (what, name))
     return path
 
 
