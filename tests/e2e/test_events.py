@@ -4,10 +4,13 @@ machine sees (standard error and output, system log, alarm peer, e-mail, the
 baseboard's LCD, paging and ID-LED groups, the simulated management controller,
 /sbin/init)."""
 
+import email
+import email.policy
 import os
 import shutil
 import socket
 import struct
+import subprocess
 import tempfile
 import threading
 import time
@@ -40,6 +43,22 @@ def keys(values):
 def alarm(component, group, event_group, severity, instance, power):
     """The 28-byte record the daemon writes to the alarm peer, as kobd prints it."""
     return struct.pack("<B3xIIIIIB3x", 1, component, group, event_group, severity, instance, power).hex()
+
+
+def listening(pid, port, timeout):
+    """True once a TCP socket of the network namespace of `pid` listens on `port`."""
+    deadline = time.monotonic() + timeout
+    while time.monotonic() < deadline:
+        try:
+            with open("/proc/%d/net/tcp" % pid) as f:
+                for line in f.readlines()[1:]:
+                    fields = line.split()
+                    if fields[1].endswith(":%04X" % port) and fields[3] == "0A":
+                        return True
+        except OSError:
+            return False
+        time.sleep(0.05)
+    return False
 
 
 class Sampler:
@@ -193,6 +212,43 @@ class EventTest(BedTestCase):
         self.assertEqual(requests, ["watchdog set: use 0x04 action hard reset countdown 1",
                                     "watchdog started: countdown 1", "watchdog expired: hard reset"])
         self.assertGreater(armed, raised)
+
+    def test_email_to_a_real_smtp_server(self):
+        # Debian's aiosmtpd, storing what it receives in a maildir.
+        python = "/usr/bin/python3"
+        if subprocess.run([python, "-c", "import aiosmtpd"], capture_output=True).returncode != 0:
+            self.skipTest("python3-aiosmtpd is not installed")
+        bed, mox, ids, _ = self.event_bed("realmail", email={1: "127.0.0.1", 2: "mox@example.org",
+                                                             3: "ops@example.org"})
+        maildir = os.path.join(bed.paths["smtp"], "maildir")
+        server = bed.spawn([python, "-m", "aiosmtpd", "-n", "-l", "127.0.0.1:25",
+                            "-c", "aiosmtpd.handlers.Mailbox", maildir])
+        self.assertTrue(listening(server.pid, 25, 10), server.stderr.data)
+        self.critical_temperature(bed, ids, [])  # its row sends e-mail as installed
+        self.raise_temperature(bed, ids)
+        deadline = time.monotonic() + 20
+        messages = []
+        while not messages and time.monotonic() < deadline:
+            time.sleep(0.2)
+            new = os.path.join(maildir, "new")
+            messages = [os.path.join(new, n) for n in os.listdir(new)] if os.path.isdir(new) else []
+        self.assertEqual(len(messages), 1, "no mail stored; stderr %r" % mox.stderr.data)
+        with open(messages[0], "rb") as f:
+            message = email.message_from_binary_file(f, policy=email.policy.compat32)
+        host = socket.gethostname()
+        self.assertEqual(message["X-MailFrom"], "mox@example.org")
+        self.assertEqual(message["X-RcptTo"], "ops@example.org")
+        # The subject line is the only header the daemon sends.
+        self.assertEqual(message["Subject"], "Zorek Server Management Alert:%s" % host)
+        self.assertEqual(message.get_payload(),
+                         "Check Temperature Probe at server %s\n"
+                         "Event Type:Temperature Critical\n"
+                         "Event Severity:Critical\n"
+                         "Component:Zorek Tessarin Baseboard\n"
+                         "Group:Temperature Probe\n"
+                         "Instance:CPU 1\n" % host)
+        # No failure line: the dialogue passed every stage.
+        self.assertEqual([e.message for e in bed.log.since(0) if "Email Alert failed" in e.message], [])
 
     def test_notification_only_and_os_shutdown(self):
         def notification_only():
