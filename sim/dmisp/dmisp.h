@@ -142,6 +142,11 @@ void setIndicationLevelCheck(uint32_t levelCheck);
 // Waits until every queued indication was handed to the registered
 // indication callbacks and those returned; false after timeoutMs.
 bool waitIndicationsDelivered(unsigned timeoutMs = 5000);
+// Waits until every queued indication was delivered and every delivered
+// one was given back through its completion callback (an application that
+// hands indications to threads of its own completes them later than its
+// callback returns); false after timeoutMs.
+bool waitIndicationsCompleted(unsigned timeoutMs = 5000);
 // Indications delivered and not yet given back through their completion callback.
 unsigned indicationsOutstanding();
 // Indications handed to callbacks since the last reset.

@@ -672,6 +672,20 @@ bool waitIndicationsDelivered(unsigned timeoutMs)
     return waitFor(s.idle, lock, timeoutMs, [&] { return s.indications.empty() && !s.delivering; });
 }
 
+bool waitIndicationsCompleted(unsigned timeoutMs)
+{
+    auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMs);
+    if (!waitIndicationsDelivered(timeoutMs))
+        return false;
+    // Completions come from the application's threads: poll.
+    while (g_outstanding.load() != 0) {
+        if (std::chrono::steady_clock::now() > end)
+            return false;
+        sleepMs(1);
+    }
+    return true;
+}
+
 unsigned indicationsOutstanding()
 {
     return g_outstanding.load();

@@ -6,7 +6,7 @@ using namespace dmisptest;
 
 namespace {
 
-class Indications : public ProviderTest {
+class DmispIndications : public ProviderTest {
 protected:
     void SetUp() override
     {
@@ -33,7 +33,7 @@ protected:
     std::vector<uint8_t> install_;
 };
 
-TEST_F(Indications, StandardEventWithTwoClassesByteForByte)
+TEST_F(DmispIndications, StandardEventWithTwoClassesByteForByte)
 {
     ASSERT_EQ(dmisp::setValue(component_, 30, 3, {"2"}, "1300"), 0u);
     ASSERT_EQ(dmisp::raiseEvent(component_, {20, {}}, {30, {"2"}}), 0u);
@@ -89,7 +89,7 @@ TEST_F(Indications, StandardEventWithTwoClassesByteForByte)
     EXPECT_EQ(dmisp::indicationsOutstanding(), 0u) << "the completion callback freed it";
 }
 
-TEST_F(Indications, RowOffsetArrayLayoutForAnotherLevelCheck)
+TEST_F(DmispIndications, RowOffsetArrayLayoutForAnotherLevelCheck)
 {
     dmisp::setIndicationLevelCheck(0x444D4932);
     ASSERT_EQ(dmisp::raiseEvent(component_, {20, {}}, {30, {"3"}}), 0u);
@@ -107,7 +107,7 @@ TEST_F(Indications, RowOffsetArrayLayoutForAnotherLevelCheck)
     EXPECT_EQ(SLRowAttributeCount(h.h), 9u);
 }
 
-TEST_F(Indications, VendorEventAndRefusedEvents)
+TEST_F(DmispIndications, VendorEventAndRefusedEvents)
 {
     ASSERT_EQ(dmisp::raiseVendorEvent(component_, {40, {}}, {30, {"1"}}), 0u);
     std::vector<uint8_t> ind = one();
@@ -144,7 +144,7 @@ TEST_F(Indications, VendorEventAndRefusedEvents)
     EXPECT_TRUE(takeIndications().empty());
 }
 
-TEST_F(Indications, ComponentInstalledAndUninstalled)
+TEST_F(DmispIndications, ComponentInstalledAndUninstalled)
 {
     // The install in SetUp raised type 2 with the component record at the
     // data offset.
@@ -174,7 +174,7 @@ TEST_F(Indications, ComponentInstalledAndUninstalled)
     EXPECT_NE(dmisp::componentId("Test Board"), 0u) << "raising the indication removes nothing";
 }
 
-TEST_F(Indications, CompletionCallbackGivesTheIndicationBack)
+TEST_F(DmispIndications, CompletionCallbackGivesTheIndicationBack)
 {
     received().complete = false; // the application keeps it for now
     unsigned before = dmisp::indicationsDelivered();
@@ -194,7 +194,10 @@ TEST_F(Indications, CompletionCallbackGivesTheIndicationBack)
         kept.swap(received().kept);
     }
     ASSERT_EQ(kept.size(), 1u);
-    complete(kept[0]);
+    EXPECT_FALSE(dmisp::waitIndicationsCompleted(50));
+    std::thread later([&] { complete(kept[0]); });
+    EXPECT_TRUE(dmisp::waitIndicationsCompleted());
+    later.join();
     EXPECT_EQ(dmisp::indicationsOutstanding(), 0u);
     takeIndications();
 }

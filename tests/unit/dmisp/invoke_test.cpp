@@ -2,6 +2,7 @@
 
 #include <chrono>
 #include <fstream>
+#include <random>
 
 #include "client.h"
 
@@ -9,7 +10,7 @@ using namespace dmisptest;
 
 namespace {
 
-class Invoke : public ProviderTest {
+class DmispInvoke : public ProviderTest {
 protected:
     void SetUp() override
     {
@@ -21,7 +22,7 @@ protected:
     Client client_;
 };
 
-TEST_F(Invoke, RegisterConfirmHoldsLevelDescriptionAndHandle)
+TEST_F(DmispInvoke, RegisterConfirmHoldsLevelDescriptionAndHandle)
 {
     Client other;
     ASSERT_EQ(other.registerApp(false), 0u);
@@ -40,7 +41,7 @@ TEST_F(Invoke, RegisterConfirmHoldsLevelDescriptionAndHandle)
     EXPECT_EQ(other.run(), static_cast<uint32_t>(dmisp::StatusNotFound));
 }
 
-TEST_F(Invoke, ComponentRecordByteForByte)
+TEST_F(DmispInvoke, ComponentRecordByteForByte)
 {
     client_.begin(512);
     client_.set(16, component_);
@@ -71,7 +72,7 @@ TEST_F(Invoke, ComponentRecordByteForByte)
     EXPECT_EQ(SLComponentFileType(client_.h(), 0), 0u);
 }
 
-TEST_F(Invoke, ListingsFollowIdOrderFiltersAndEndWithAFailure)
+TEST_F(DmispInvoke, ListingsFollowIdOrderFiltersAndEndWithAFailure)
 {
     uint32_t second = installSample();
     std::string error;
@@ -144,7 +145,7 @@ TEST_F(Invoke, ListingsFollowIdOrderFiltersAndEndWithAFailure)
     }
 }
 
-TEST_F(Invoke, GroupEntryCarriesKeyAttributesWithoutValues)
+TEST_F(DmispInvoke, GroupEntryCarriesKeyAttributesWithoutValues)
 {
     client_.begin(516);
     client_.set(16, component_);
@@ -161,7 +162,7 @@ TEST_F(Invoke, GroupEntryCarriesKeyAttributesWithoutValues)
     EXPECT_EQ(text(SLGroupClassName(client_.h(), 0)), "DMTF|Voltage Probe|001");
 }
 
-TEST_F(Invoke, AttributeEntryWithEnumerationByteForByte)
+TEST_F(DmispInvoke, AttributeEntryWithEnumerationByteForByte)
 {
     client_.begin(520);
     client_.set(16, component_);
@@ -198,7 +199,7 @@ TEST_F(Invoke, AttributeEntryWithEnumerationByteForByte)
     }
 }
 
-TEST_F(Invoke, GetAttributeConfirmByTypeAndKeys)
+TEST_F(DmispInvoke, GetAttributeConfirmByTypeAndKeys)
 {
     // Confirm words: attribute id, group id, type, value offset; value at 16.
     client_.begin(768);
@@ -248,7 +249,7 @@ TEST_F(Invoke, GetAttributeConfirmByTypeAndKeys)
     }
 }
 
-TEST_F(Invoke, SetAttributeChecksTypeSizeAndAccess)
+TEST_F(DmispInvoke, SetAttributeChecksTypeSizeAndAccess)
 {
     auto set = [&](uint32_t group, uint32_t attribute, std::vector<std::pair<uint32_t, int32_t>> keys,
                    const std::vector<uint8_t>& value) {
@@ -334,7 +335,7 @@ TEST_F(Invoke, SetAttributeChecksTypeSizeAndAccess)
     }
 }
 
-TEST_F(Invoke, RowsCarryKeysAndStartAfterTheGivenAttribute)
+TEST_F(DmispInvoke, RowsCarryKeysAndStartAfterTheGivenAttribute)
 {
     client_.begin(772);
     client_.set(16, component_);
@@ -404,7 +405,7 @@ TEST_F(Invoke, RowsCarryKeysAndStartAfterTheGivenAttribute)
     }
 }
 
-TEST_F(Invoke, MalformedBlocksFailWithoutWritingOutsideTheConfirm)
+TEST_F(DmispInvoke, MalformedBlocksFailWithoutWritingOutsideTheConfirm)
 {
     const uint32_t Malformed = dmisp::StatusMalformed;
     const struct {
@@ -448,7 +449,7 @@ TEST_F(Invoke, MalformedBlocksFailWithoutWritingOutsideTheConfirm)
     EXPECT_EQ(DmiInvoke(nullptr), dmisp::InvokeRefused);
 }
 
-TEST_F(Invoke, InstallAndUninstallCompleteBeforeDmiInvokeReturns)
+TEST_F(DmispInvoke, InstallAndUninstallCompleteBeforeDmiInvokeReturns)
 {
     std::string path = dir_ + "/board.mif";
     std::ofstream(path) << sampleMif();
@@ -490,7 +491,7 @@ TEST_F(Invoke, InstallAndUninstallCompleteBeforeDmiInvokeReturns)
     }
 }
 
-TEST_F(Invoke, FaultsBusyRefuseNoConfirmListingStatusAndDelay)
+TEST_F(DmispInvoke, FaultsBusyRefuseNoConfirmListingStatusAndDelay)
 {
     auto listNext = [&]() {
         client_.begin(514);
@@ -532,7 +533,7 @@ TEST_F(Invoke, FaultsBusyRefuseNoConfirmListingStatusAndDelay)
     EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(150));
 }
 
-TEST_F(Invoke, CommandsWithoutAnyRegistrationAreRefused)
+TEST_F(DmispInvoke, CommandsWithoutAnyRegistrationAreRefused)
 {
     client_.begin(257);
     ASSERT_EQ(client_.run(), 0u);
@@ -541,6 +542,54 @@ TEST_F(Invoke, CommandsWithoutAnyRegistrationAreRefused)
     EXPECT_EQ(client_.send(), dmisp::InvokeRefused);
     client_.begin(1025); // completes without a callback
     EXPECT_EQ(client_.send(), 0u);
+}
+
+// Random parameter words on every command code: no crash, no read outside
+// the block (AddressSanitizer), nothing written past the confirm size the
+// block states.
+TEST_F(DmispInvoke, RandomCommandBlocksNeverWriteOutsideTheirConfirm)
+{
+    const uint32_t codes[] = {257, 258, 512, 513, 514, 515, 516, 517, 518, 519, 520, 521,
+                              522, 523, 768, 769, 770, 771, 772, 773, 774, 1024, 1025, 4711};
+    std::mt19937 random(7);
+    auto pick = [&]() -> uint32_t {
+        switch (random() % 6) {
+        case 0: return 0;
+        case 1: return random() % 8;
+        case 2: return 20 + random() % 30; // group and attribute ids
+        case 3: return 60 + random() % 4100; // offsets around the block
+        case 4: return 0xFFFFFFFF - random() % 16;
+        default: return static_cast<uint32_t>(random());
+        }
+    };
+    for (int i = 0; i < 3000; ++i) {
+        uint32_t code = codes[random() % (sizeof codes / sizeof codes[0])];
+        if (code == 257)
+            continue; // keeps the registration
+        client_.begin(code);
+        client_.set(7, 4096);
+        client_.set(16, random() % 3 == 0 ? pick() : component_);
+        for (uint32_t w = 17; w < 40; ++w)
+            client_.set(w, pick());
+        if (random() % 2 == 0) {
+            // A plausible key list so that lookups go deeper.
+            client_.set(18, 1 + random() % 3);
+            client_.set(19, 84);
+            client_.set(22, 1);
+            client_.set(23, random() % 2 == 0 ? 5 : 8);
+            client_.set(24, random() % 2 == 0 ? 96 : pick());
+        }
+        uint32_t status = client_.run();
+        ASSERT_NE(status, 0xFFFFFFFFu) << "code " << code << " not confirmed";
+        ASSERT_NE(status, 512u);
+        ASSERT_NE(status, 522u);
+        bool untouched = true;
+        for (uint32_t b = 4096; b < client_.h()->confirmSize; ++b)
+            untouched = untouched && client_.h()->confirm[b] == 0xEE;
+        ASSERT_TRUE(untouched) << "code " << code;
+    }
+    // The database is unharmed by what the random sets may have changed.
+    EXPECT_EQ(dmisp::components().size(), 1u);
 }
 
 } // namespace

@@ -1,6 +1,8 @@
 #include <gtest/gtest.h>
 
+#include <fstream>
 #include <random>
+#include <sstream>
 #include <string>
 
 #include "dmisp/miftext.h"
@@ -81,7 +83,7 @@ Start Component
 end component
 )MIF";
 
-TEST(MifText, ParsesEveryConstructOfTheGrammar)
+TEST(DmispMifText, ParsesEveryConstructOfTheGrammar)
 {
     Component c;
     std::string error;
@@ -131,7 +133,7 @@ std::string variant(const std::string& from, const std::string& to)
     return s.replace(at, from.size(), to);
 }
 
-TEST(MifText, RefusesBadFilesWithLineAndReason)
+TEST(DmispMifText, RefusesBadFilesWithLineAndReason)
 {
     const struct {
         std::string text;
@@ -183,7 +185,7 @@ TEST(MifText, RefusesBadFilesWithLineAndReason)
     }
 }
 
-TEST(MifText, WriterOutputReadsBackToTheSameContent)
+TEST(DmispMifText, WriterOutputReadsBackToTheSameContent)
 {
     Component c;
     std::string error;
@@ -205,7 +207,7 @@ TEST(MifText, WriterOutputReadsBackToTheSameContent)
     }
 }
 
-TEST(MifText, TwoTablesFromOneTemplateKeepTheirOwnRows)
+TEST(DmispMifText, TwoTablesFromOneTemplateKeepTheirOwnRows)
 {
     std::string text = R"(start component name = "t"
         start group name = "T" class = "C|T|1" key = 1
@@ -229,7 +231,7 @@ TEST(MifText, TwoTablesFromOneTemplateKeepTheirOwnRows)
 
 // Damaged variants of a good file never crash the parser or read outside
 // the text (checked under AddressSanitizer).
-TEST(MifText, DamagedTextIsRefusedOrParsedButNeverCrashes)
+TEST(DmispMifText, DamagedTextIsRefusedOrParsedButNeverCrashes)
 {
     std::mt19937 random(12345);
     const std::string good = goodMif;
@@ -256,6 +258,28 @@ TEST(MifText, DamagedTextIsRefusedOrParsedButNeverCrashes)
         }
     }
     EXPECT_GT(refused, 1000);
+}
+
+TEST(DmispMifText, ShippedMifsReadBackToTheSameContent)
+{
+    const std::string dir = MOX_SOURCE_DIR "/mifs/";
+    int found = 0;
+    for (const char* file : {"mox.mif", "baseboard.mif", "enclosure.mif", "old/mox-2.40.mif", "old/mox-2.60.mif",
+                             "old/mox-2.92.mif"}) {
+        std::ifstream in(dir + file);
+        if (!in.good())
+            continue;
+        ++found;
+        std::stringstream text;
+        text << in.rdbuf();
+        Component c, back;
+        std::string error;
+        ASSERT_TRUE(parseMif(text.str(), file, &c, &error)) << error;
+        ASSERT_TRUE(parseMif(writeMif(c), file, &back, &error)) << error;
+        EXPECT_EQ(back, c) << file;
+    }
+    if (found == 0)
+        GTEST_SKIP() << "no shipped MIFs in " << dir;
 }
 
 } // namespace

@@ -20,9 +20,9 @@ std::string readAll(const std::string& path)
     return s.str();
 }
 
-class Database : public ProviderTest {};
+class DmispDatabase : public ProviderTest {};
 
-TEST_F(Database, RestartFindsTheSameComponentsIdsRowsAndValues)
+TEST_F(DmispDatabase, RestartFindsTheSameComponentsIdsRowsAndValues)
 {
     uint32_t a = installSample();
     uint32_t b = installSample();
@@ -68,7 +68,7 @@ TEST_F(Database, RestartFindsTheSameComponentsIdsRowsAndValues)
     EXPECT_EQ(installSample(), c + 1);
 }
 
-TEST_F(Database, ACorruptOrHalfWrittenFileTakesNothingElseDown)
+TEST_F(DmispDatabase, ACorruptOrHalfWrittenFileTakesNothingElseDown)
 {
     uint32_t a = installSample();
     dmisp::shutdown();
@@ -89,7 +89,7 @@ TEST_F(Database, ACorruptOrHalfWrittenFileTakesNothingElseDown)
     EXPECT_EQ(installSample(), 8u) << "ids of unreadable files are not reused";
 }
 
-TEST_F(Database, OneProviderAtATimeHoldsTheDirectory)
+TEST_F(DmispDatabase, OneProviderAtATimeHoldsTheDirectory)
 {
     dmisp::Database second;
     std::string error;
@@ -100,7 +100,7 @@ TEST_F(Database, OneProviderAtATimeHoldsTheDirectory)
     second.close();
 }
 
-TEST_F(Database, FilesAreRewrittenOnEveryChange)
+TEST_F(DmispDatabase, FilesAreRewrittenOnEveryChange)
 {
     uint32_t a = installSample();
     std::string path = dir_ + "/component-" + std::to_string(a) + ".mif";
@@ -117,9 +117,30 @@ TEST_F(Database, FilesAreRewrittenOnEveryChange)
     EXPECT_FALSE(dmisp::writeFileAtomically(dir_ + "/missing/x", "new"));
 }
 
+TEST_F(DmispDatabase, StartsOnFirstUseFromTheEnvironment)
+{
+    uint32_t a = installSample();
+    dmisp::shutdown();
+    EXPECT_EQ(dmisp::databaseDirectory(), "");
+    setenv("DMISP_DB", dir_.c_str(), 1);
+    std::string socket = dir_ + "/other.sock";
+    setenv("DMISP_SOCKET", socket.c_str(), 1);
+    Client client;
+    EXPECT_EQ(client.registerApp(false), 0u); // the first DmiInvoke opens it
+    unsetenv("DMISP_DB");
+    unsetenv("DMISP_SOCKET");
+    EXPECT_EQ(dmisp::databaseDirectory(), dir_);
+    EXPECT_EQ(dmisp::controlSocketPath(), socket);
+    std::string out;
+    EXPECT_EQ(dmisp::controlRequest(socket, {"list"}, &out), 0);
+    EXPECT_EQ(out, std::to_string(a) + "\tTest Board\n");
+    dmisp::shutdown();
+    EXPECT_EQ(dmisp::controlRequest(socket, {"list"}, &out), -1) << "nobody listens once it is closed";
+}
+
 // The command-line client against a running provider, and on the
 // database alone when no provider runs.
-class Tool : public ProviderTest {
+class DmispTool : public ProviderTest {
 protected:
     bool serveControl() override { return true; }
     int dmictl(const std::string& args, std::string* out)
@@ -136,7 +157,7 @@ protected:
     }
 };
 
-TEST_F(Tool, ListsGetsSetsAndRaisesAnEventThatTheApplicationReceives)
+TEST_F(DmispTool, ListsGetsSetsAndRaisesAnEventThatTheApplicationReceives)
 {
     Client client;
     ASSERT_EQ(client.registerApp(true), 0u);
@@ -190,7 +211,7 @@ TEST_F(Tool, ListsGetsSetsAndRaisesAnEventThatTheApplicationReceives)
     EXPECT_EQ(client.send(), dmisp::InvokeBusy);
 }
 
-TEST_F(Tool, WorksOnTheDatabaseWhenNoProviderRuns)
+TEST_F(DmispTool, WorksOnTheDatabaseWhenNoProviderRuns)
 {
     dmisp::shutdown();
     std::string path = dir_ + "/board.mif";
@@ -213,6 +234,51 @@ TEST_F(Tool, WorksOnTheDatabaseWhenNoProviderRuns)
     // While it runs, the tool goes through its socket.
     EXPECT_EQ(dmictl("status", &out), 0) << out;
     EXPECT_NE(out.find("database\t" + dir_), std::string::npos) << out;
+}
+
+TEST_F(DmispTool, ListsTheShippedMifsAndRaisesAnEventFromThem)
+{
+    const std::string mifs = MOX_SOURCE_DIR "/mifs";
+    if (!std::ifstream(mifs + "/mox.mif").good() || !std::ifstream(mifs + "/baseboard.mif").good())
+        GTEST_SKIP() << "no shipped MIFs in " << mifs;
+    Client client;
+    ASSERT_EQ(client.registerApp(true), 0u);
+    std::string out;
+    for (const char* file : {"baseboard.mif", "mox.mif"})
+        ASSERT_EQ(dmictl(std::string("install ") + mifs + "/" + file, &out), 0) << out;
+    ASSERT_EQ(dmictl("list", &out), 0);
+    EXPECT_EQ(out, "1\tZorek Tessarin Baseboard\n2\tZorek Tessarin Server Manager - Mox\n");
+    takeIndications();
+    // Every event-generation group of the baseboard names its instance
+    // group by class in attribute 5; raise one event per group, with the
+    // instance group's first row.
+    unsigned raised = 0;
+    for (const dmisp::GroupInfo& g : dmisp::groups(1)) {
+        if (g.className.rfind("EventGeneration|", 0) != 0)
+            continue;
+        std::string instanceClass;
+        ASSERT_EQ(dmisp::getValue(1, g.id, 5, {}, &instanceClass), 0u) << g.name;
+        uint32_t instance = 0;
+        for (const dmisp::GroupInfo& i : dmisp::groups(1))
+            if (i.className == instanceClass)
+                instance = i.id;
+        ASSERT_NE(instance, 0u) << instanceClass;
+        std::string key = dmisp::rows(1, instance).at(0).at(0);
+        ASSERT_EQ(dmictl("event 1 " + std::to_string(g.id) + " --instance " + std::to_string(instance) + " -k " + key,
+                         &out),
+                  0)
+            << out;
+        auto events = takeIndications();
+        ASSERT_EQ(events.size(), 1u);
+        IndicationHandle h(events[0]);
+        EXPECT_EQ(text(SLEventClassString(h.h, 0)), g.className);
+        EXPECT_EQ(text(SLEventClassString(h.h, 1)), instanceClass);
+        SLEventSelectRowCnf(h.h, 1, 0);
+        EXPECT_EQ(SLRowGroupId(h.h), instance);
+        EXPECT_EQ(std::to_string(SLRowIntegerValue(h.h, 0)), key);
+        ++raised;
+    }
+    EXPECT_GE(raised, 4u);
 }
 
 } // namespace
