@@ -187,6 +187,28 @@ double substituteProviderRate(double seconds)
         }
         if (rate == 0)
             rate = commands / std::chrono::duration<double>(Clock::now() - start).count();
+        // 19 more components; then look up the 20th by name.
+        for (int i = 2; i <= 20 && rate > 0; ++i) {
+            std::string other = "start component\n  name = \"Other " + std::to_string(i) +
+                                "\"\n  start group\n    name = \"G\"  class = \"Zorek|G|001\"  id = 1\n"
+                                "    start attribute name = \"A\" id = 1 type = integer value = 1 end attribute\n"
+                                "  end group\nend component\n";
+            if (dmisp::installText(other, "other.mif", &error) == 0)
+                rate = 0;
+        }
+        long lookups = 0;
+        auto lookupStart = Clock::now();
+        auto lookupEnd = lookupStart + std::chrono::duration<double>(seconds);
+        while (rate > 0 && Clock::now() < lookupEnd) {
+            if (SLMapComponentNameToId("Other 20") == 0) {
+                std::fprintf(stderr, "lookup failed\n");
+                break;
+            }
+            ++lookups;
+        }
+        if (lookups > 0)
+            std::printf("name lookup over 20 components, substitute provider: %8.1f us\n",
+                        std::chrono::duration<double>(Clock::now() - lookupStart).count() * 1e6 / lookups);
         SLDmiUnregisterMgmt(h);
         SLDeleteKeyList(keys);
     } else {

@@ -12,7 +12,9 @@
 
 extern "C" {
 
-// The provider's entry point, exported by its client library.
+// The provider's entry point, exported by its client library. The library
+// refers to it weakly: in a program linked without a provider it is null, and
+// every command fails as in an uninitialised library.
 uint32_t DmiInvoke(void* commandBlock);
 
 typedef uint32_t (*SLInvokeFunction)(void* commandBlock);

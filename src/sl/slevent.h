@@ -9,6 +9,12 @@ void SLEventCleanup(void);
 // Installs `handler`; with null, waits until no event thread is running.
 void SLEventSetHandler(SLIndicationHandler handler);
 // The indication callback handed to the provider by the register command.
+// Copies the indication into a handle and runs the handler on an event thread
+// of its own (64 KiB stack); without a handler, or when the indication's
+// stated length is below its 52-byte header or above 1 MiB, it is completed at
+// once and dropped.
 void SLIndicationFunc(void* indication);
+// Runs the handler (if one is still installed) on the handle, completes the
+// indication and frees the handle.
 void* SLEventThread(void* handle);
 }

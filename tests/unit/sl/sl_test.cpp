@@ -186,6 +186,31 @@ TEST(SLCommand, RegisterPlacesTheCallbacksAndKeepsTheManagementHandle)
     EXPECT_EQ(provider.word(4, 3), 0x51u);
 }
 
+TEST(SLCommand, HandlerIsInPlaceBeforeTheRegisterCommandCompletes)
+{
+    ScriptedProvider provider;
+    static std::atomic<int> handled{0};
+    handled = 0;
+    static uint8_t indication[64];
+    storeWordAt(indication, 1, 1);
+    storeWordAt(indication, 2, sizeof indication);
+    // The provider delivers an indication while the register command is
+    // still outstanding.
+    Reply registered;
+    registered.fill = [](uint8_t* confirm, uint32_t) {
+        SLIndicationFunc(indication);
+        storeWordAt(confirm, 2, 1);
+    };
+    provider.push(registered);
+    SLHandle* h = SLCreateHandle(0);
+    ASSERT_EQ(SLDmiRegisterMgmt(h, [](SLHandle*) { return ++handled; }), 0);
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
+    while (handled == 0 && std::chrono::steady_clock::now() < deadline)
+        std::this_thread::yield();
+    EXPECT_EQ(handled.load(), 1);
+    SLDmiUnregisterMgmt(h);
+}
+
 TEST(SLCommand, FailedRegistrationRemovesTheHandler)
 {
     ScriptedProvider provider;
@@ -459,6 +484,56 @@ TEST(SLCommand, CleanupDuringTheWaitEndsItWithStatus522)
     waiter.join();
     EXPECT_EQ(result.load(), 1);
     EXPECT_EQ(SLCnfStatus(h), 522u);
+}
+
+TEST(SLCommand, CleanupLetsTheWaitingCommandLeaveBeforeFreeingItsHandle)
+{
+    // Under AddressSanitizer: the abandoned command must not touch its handle
+    // (an SL handle, freed by the cleanup) after the cleanup has freed it.
+    ScriptedProvider provider;
+    Reply never;
+    never.confirm = false;
+    provider.push(never);
+    SLHandle* h = SLCreateHandle(0);
+    std::atomic<int> result{-1};
+    std::thread waiter([&] { result = SLListFirstGroup(h, 1); });
+    while (provider.blocks.empty())
+        std::this_thread::yield();
+    provider.cleanupNow();
+    waiter.join();
+    EXPECT_EQ(result.load(), 1);
+}
+
+TEST(SLCommand, UnregisterWaitsForRunningHandlersBeforeIssuing257)
+{
+    ScriptedProvider provider;
+    static std::atomic<bool> hold{true};
+    static std::atomic<int> entered{0};
+    hold = true;
+    entered = 0;
+    SLHandle* h = SLCreateHandle(0);
+    ASSERT_EQ(SLDmiRegisterMgmt(h, [](SLHandle*) {
+                  ++entered;
+                  while (hold)
+                      std::this_thread::sleep_for(std::chrono::milliseconds(1));
+                  return 0;
+              }),
+              0);
+    uint8_t indication[64] = {};
+    storeWordAt(indication, 1, 1);
+    storeWordAt(indication, 2, sizeof indication);
+    SLIndicationFunc(indication);
+    while (entered == 0)
+        std::this_thread::yield();
+    std::atomic<int> result{-1};
+    std::thread unregister([&] { result = SLDmiUnregisterMgmt(h); });
+    std::this_thread::sleep_for(std::chrono::milliseconds(30));
+    EXPECT_EQ(provider.blocks.size(), 1u) << "257 waits for the running handler";
+    hold = false;
+    unregister.join();
+    EXPECT_EQ(result.load(), 0);
+    ASSERT_EQ(provider.blocks.size(), 2u);
+    EXPECT_EQ(provider.code(1), 257u);
 }
 
 TEST(SLCommand, ConfirmCallbackClearsPendingAndReturnsItsArgument)

@@ -188,6 +188,9 @@ void awaitHandled(int value)
 TEST(SLFuzz, ArbitraryIndicationBytes)
 {
     std::mt19937 random(20261206);
+    handled = 0;
+    valuesRead = 0;
+    keyListsMade = 0;
     unsigned live = slLiveStringCount();
     SLEventInitialize();
     SLEventSetHandler(sweepingHandler);

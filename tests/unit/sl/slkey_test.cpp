@@ -134,6 +134,27 @@ TEST(SLKey, CreateFromRowAndFromSelectedEventRow)
     SLDeleteKeyList(k);
     SLEventSelectRowCnf(ev.get(), 0, 0);
     EXPECT_EQ(SLCreateKeyList(ev.get()), nullptr) << "row 0 has no keys";
+
+    // The other layout: the rows offset names an array of row offsets.
+    Record array(1, 1000);
+    array.header(0, 0x12345678);
+    array.header(12, 64);
+    array.word(64, 1);
+    array.word(64 + 4 + 12, 300);
+    array.word(300, 0);   // row 0: none of interest
+    array.word(304, 500); // row 1 at 500
+    array.word(500 + 4, 2);
+    array.word(500 + 8, 700);
+    array.keys(700, {{{1, DMI_INTEGER, 740}}, {{2, DMI_OCTETSTRING, 744}}});
+    array.word(740, 17);
+    array.text(744, "ab");
+    SLEventSelectRowCnf(array.get(), 0, 1);
+    k = SLCreateKeyList(array.get());
+    ASSERT_NE(k, nullptr);
+    EXPECT_EQ(k->count, 2u);
+    EXPECT_EQ(loadWord(k->keys[0].value), 17u);
+    EXPECT_EQ(valueText(k->keys[1]), "ab");
+    SLDeleteKeyList(k);
 }
 
 TEST(SLKey, RowsThatCannotBeCopiedGiveNoList)

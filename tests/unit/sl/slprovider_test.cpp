@@ -163,6 +163,21 @@ TEST_F(SLProvider, InstallListAndMapNames)
     EXPECT_EQ(SLInstallMIF(h_, "absent.mif"), 1);
 }
 
+TEST_F(SLProvider, ShippedMifsInstallAndReportTheirVersions)
+{
+    setenv("UXDMIPATH", MOX_MIF_DIR, 1);
+    ASSERT_EQ(SLInstallMIF(h_, "baseboard.mif"), 0) << SLCnfStatus(h_);
+    ASSERT_EQ(SLInstallMIF(h_, "mox.mif"), 0) << SLCnfStatus(h_);
+    uint32_t mox = SLMapComponentNameToId("Zorek Tessarin Server Manager - Mox");
+    ASSERT_NE(mox, 0u);
+    EXPECT_NE(SLMapComponentNameToId("Zorek Tessarin Baseboard"), mox);
+    float version = 0;
+    ASSERT_EQ(SLGetInstalledMIFVersion(h_, "Zorek Tessarin Server Manager - Mox", &version), 0);
+    EXPECT_FLOAT_EQ(version, 2.93f);
+    ASSERT_EQ(SLGetInstalledMIFVersion(h_, "Zorek Tessarin Baseboard", &version), 0);
+    EXPECT_FLOAT_EQ(version, 1.0f);
+}
+
 TEST_F(SLProvider, RowsByKeysAndValuesWithKeys)
 {
     uint32_t board = install();
@@ -206,7 +221,12 @@ TEST_F(SLProvider, EventsReachTheHandlerAndAreCompleted)
 {
     uint32_t board = install();
     ASSERT_NE(board, 0u);
+    // The install indication: handled on an event thread, then completed.
     ASSERT_TRUE(dmisp::waitIndicationsDelivered());
+    auto settle = std::chrono::steady_clock::now() + std::chrono::seconds(5);
+    while (dmisp::indicationsOutstanding() != 0 && std::chrono::steady_clock::now() < settle)
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    ASSERT_EQ(dmisp::indicationsOutstanding(), 0u);
     int before = seen.count;
     ASSERT_EQ(dmisp::raiseEvent(board, {20, {}}, {30, {"2"}}), 0u);
     ASSERT_TRUE(dmisp::waitIndicationsDelivered());
