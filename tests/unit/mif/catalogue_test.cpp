@@ -79,45 +79,13 @@ TEST_F(Catalogue, UnknownIdsGiveFallbacksWithoutCommands)
     EXPECT_GT(dmisp::commandsReceived(), before);
 }
 
-// Answers the listing of attribute 99 itself, with an enumeration that the
-// provider's MIF reader would refuse: value 1 listed twice.
-uint32_t duplicateEnumeration(void* block)
-{
-    if (loadWordAt(block, 1) != 520 || loadWordAt(block, 18) != 99)
-        return DmiInvoke(block);
-    auto* confirm = static_cast<uint8_t*>(wordPointer(loadWordAt(block, 8)));
-    const struct {
-        int32_t value;
-        const char* text;
-    } entries[] = {{0, "Off"}, {1, "On"}, {1, "Running"}, {2, "Failed"}};
-    const uint32_t count = 4;
-    uint32_t offset = 7 * 4 + 8 * count; // the entry, then the enumeration list
-    auto putString = [&](const char* text) {
-        uint32_t at = offset;
-        storeWord(confirm + at, static_cast<uint32_t>(strlen(text)));
-        memcpy(confirm + at + 4, text, strlen(text));
-        offset += 4 + static_cast<uint32_t>(strlen(text));
-        return at;
-    };
-    // Attribute entry: id, name, access, type, maximum size, enumeration count and list.
-    const uint32_t words[] = {99, putString("Duplicated"), 1, 5, 4, count, 28};
-    for (uint32_t i = 0; i < 7; ++i)
-        storeWordAt(confirm, i, words[i]);
-    for (uint32_t i = 0; i < count; ++i) {
-        storeWordAt(confirm + 28, 2 * i, static_cast<uint32_t>(entries[i].value));
-        storeWordAt(confirm + 28, 2 * i + 1, putString(entries[i].text));
-    }
-    storeWordAt(block, 10, 1);
-    storeWordAt(block, 11, 0);
-    dmiConfirmFunc(block);
-    return 0;
-}
-
 TEST_F(Catalogue, DuplicateEnumerationValueGivesTheLaterText)
 {
     ASSERT_STREQ(GroupName(h, component, 1), "Scalars");
-    SLDmiInvoke = duplicateEnumeration;
-    EXPECT_STREQ(AttributeName(h, component, 1, 99), "Duplicated");
+    // The provider's MIF reader refuses an enumeration that lists a value twice.
+    scriptedAttribute() = ScriptedAttribute{99, 5, {{0, "Off"}, {1, "On"}, {1, "Running"}, {2, "Failed"}}};
+    SLDmiInvoke = answerScriptedAttribute;
+    EXPECT_STREQ(AttributeName(h, component, 1, 99), "Scripted");
     SLDmiInvoke = DmiInvoke;
     EXPECT_STREQ(AttributeEnumerationString(h, component, 1, 99, 0), "Off");
     EXPECT_STREQ(AttributeEnumerationString(h, component, 1, 99, 1), "Running");

@@ -103,6 +103,24 @@ TEST_F(Formatting, FailedReadWritesTheNoValueText)
     EXPECT_EQ(result, 0);
 }
 
+TEST_F(Formatting, TypesWithoutConversionReadAsNoValue)
+{
+    for (uint32_t type : {4u, 9u, 10u}) {
+        SCOPED_TRACE(type);
+        uint32_t attribute = 90 + type;
+        scriptedAttribute() = ScriptedAttribute{attribute, type, {}};
+        SLDmiInvoke = answerScriptedAttribute;
+        EXPECT_EQ(AttributeType(h, component, 1, attribute), type);
+        SLDmiInvoke = DmiInvoke;
+        uint64_t before = dmisp::commandsReceived();
+        char buffer[16];
+        EXPECT_EQ(GetPureValue(h, component, 1, attribute, nullptr, buffer, sizeof buffer), 0);
+        EXPECT_STREQ(buffer, "        ");
+        EXPECT_EQ(SetPureValue(h, component, 1, attribute, nullptr, "1"), 0);
+        EXPECT_EQ(dmisp::commandsReceived(), before) << "nothing is read or written";
+    }
+}
+
 TEST_F(Formatting, SetsByType)
 {
     struct Case {
