@@ -21,6 +21,7 @@ namespace {
 std::atomic<int> eventThreadRunning{0};
 std::atomic<int> threadId{0}; // 1 while the worker is inside its loop
 std::atomic<unsigned> numberOfEvents{0};
+std::atomic<int> workersInLoop{0}; // for tests: never more than one
 
 // The queue owns the handles on it; the worker is its only remover.
 SLHandleListHead slHandleList;
@@ -90,6 +91,7 @@ void eventActions(SLHandle* handle)
 void* eventHandlerThread(void*)
 {
     threadId = 1;
+    ++workersInLoop;
     while (eventThreadRunning == 1) {
         SLHandle* handle = SLHeadHandle(slHandleList.get());
         if (handle == nullptr) {
@@ -99,6 +101,7 @@ void* eventHandlerThread(void*)
         processEvent(handle);
         SLDestroyHandle(handle);
     }
+    --workersInLoop;
     threadId = 0;
     return nullptr;
 }
@@ -152,12 +155,18 @@ int CreateEventHandler(void)
 {
     slInitHandleList(slHandleList.get());
     eventThreadRunning = 1;
+    // Counted as running from here, not from its first step: a KillEventThread
+    // that comes before the thread has started must still wait for it, or a
+    // later CreateEventHandler could leave two workers on one queue.
+    threadId = 1;
     pthread_attr_t attributes;
     pthread_attr_init(&attributes);
     pthread_attr_setdetachstate(&attributes, PTHREAD_CREATE_DETACHED);
     pthread_t thread;
     int rc = pthread_create(&thread, &attributes, eventHandlerThread, nullptr);
     pthread_attr_destroy(&attributes);
+    if (rc != 0)
+        threadId = 0;
     return rc;
 }
 
@@ -177,6 +186,11 @@ int DestroyEventHandler(void)
 unsigned EventsHandled(void)
 {
     return numberOfEvents;
+}
+
+int eventsWorkersRunning()
+{
+    return workersInLoop;
 }
 
 unsigned eventsQueued()

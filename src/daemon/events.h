@@ -30,6 +30,8 @@ struct EventCallees {
 };
 EventCallees eventsSetCallees(const EventCallees& callees);
 EventCallees eventsDefaultCallees();
+// Workers inside their loop (at most one).
+int eventsWorkersRunning();
 // Handles waiting in the queue.
 unsigned eventsQueued();
 // Runs the worker's classification of one handle on the calling thread.

@@ -159,6 +159,22 @@ TEST_F(EventQueue, DestroyFreesWhatIsStillQueued)
     EXPECT_EQ(slLiveStringCount(), live);
 }
 
+TEST_F(EventQueue, StopBeforeTheWorkerStartedStillWaitsForIt)
+{
+    // A worker stopped before its first step, and a new one started at once:
+    // the queue must never have two consumers.
+    for (int round = 0; round < 2; ++round) {
+        ASSERT_EQ(CreateEventHandler(), 0);
+        KillEventThread();
+        EXPECT_EQ(eventsWorkersRunning(), 0) << "KillEventThread returned while a worker could still run";
+    }
+    ASSERT_EQ(CreateEventHandler(), 0);
+    std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    EXPECT_EQ(eventsWorkersRunning(), 1);
+    DestroyEventHandler();
+    EXPECT_EQ(eventsWorkersRunning(), 0);
+}
+
 TEST_F(EventQueue, ConcurrentProducersEveryHandleOnce)
 {
     constexpr uint32_t producers = 8, perProducer = 1250; // 10,000 in all

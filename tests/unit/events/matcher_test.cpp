@@ -18,7 +18,9 @@
 #include "daemon/events.h"
 #include "dmisp/dmisp.h"
 #include "mif/mif.h"
+#include "base/sleep.h"
 #include "obx/obxapi.h"
+#include "simdriver.h"
 #include "sl/sl.h"
 #include "sl/slevent.h"
 #include "sl/slhandle.h"
@@ -125,11 +127,7 @@ protected:
     // provider hears of an indication's completion only then.
     static void settle()
     {
-        EXPECT_TRUE(dmisp::waitIndicationsDelivered());
-        auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-        while (dmisp::indicationsOutstanding() != 0 && std::chrono::steady_clock::now() < deadline)
-            std::this_thread::sleep_for(std::chrono::milliseconds(2));
-        EXPECT_EQ(dmisp::indicationsOutstanding(), 0u);
+        EXPECT_TRUE(dmisp::waitIndicationsCompleted(10000));
     }
     Codes deliver(const std::function<uint32_t()>& raise)
     {
@@ -365,19 +363,15 @@ TEST_F(Notifications, UnknownClassIsLoggedByTheWorker)
     EXPECT_EQ(lines(), (Lines{{LOG_NOTICE, "DMI Unknown Indication Test Board\n"}}));
 }
 
-std::atomic<int> driverOpens{0};
-
-TEST_F(Notifications, NotificationsOnlyStillNotifies)
+TEST_F(Notifications, ResetReachesTheControllerUnlessNotificationsOnly)
 {
-    // Every attempt to reach the controller goes through the device's open.
-    static const ObxOs counting{[](const char*, int) {
-                                    ++driverOpens;
-                                    errno = ENOENT;
-                                    return -1;
-                                },
-                                nullptr, nullptr, nullptr, nullptr};
-    obxSetOs(&counting);
+    obxsimReset();
+    hDevice1 = 0;
+    IpmiVersion = 0;
+    obxSetOs(&simOs);
+    moxSetSleepHook([](unsigned) {}); // the 3 s before the watchdog starts
     start(ownMif(stdRow(1, 20, 4, 1, 0, {8, 9, 15}), ""));
+
     bNotificationOnly = 1;
     testing::internal::CaptureStderr();
     voltage(board_, 1, 8);
@@ -385,13 +379,19 @@ TEST_F(Notifications, NotificationsOnlyStillNotifies)
     EXPECT_EQ(testing::internal::GetCapturedStderr(),
               "MOX: Event type \"Voltage Above Upper Critical\" reported for \"Voltage Probe\" group.\n");
     EXPECT_EQ(lines().size(), 1u) << "the log line";
-    EXPECT_EQ(driverOpens, 0) << "nothing reached the driver";
+    EXPECT_EQ(obxsimOpenCount(), 0) << "nothing reached the driver";
+    EXPECT_TRUE(obxsimRequests().empty());
 
-    // The same row without the setting asks the controller for the reset.
+    // The same row without the setting arms and starts the watchdog.
     testing::internal::CaptureStderr();
     voltage(board_, 1, 8);
     testing::internal::GetCapturedStderr();
-    EXPECT_GT(driverOpens, 0);
+    EXPECT_TRUE(obxsimWaitForLog("watchdog expired: hard reset", 3000));
+
+    moxSetSleepHook(nullptr);
+    if (hDevice1 != 0)
+        obxsimClose(hDevice1);
+    hDevice1 = 0;
     obxSetOs(nullptr);
 }
 
