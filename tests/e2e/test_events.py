@@ -329,8 +329,9 @@ class EventTest(BedTestCase):
                 self.assertEqual(bed.dmictl("get", ids["baseboard"], 32, 6), page + "\n", name)
                 attribute, group = ("Unknown", "Unknown") if not instance else (
                     ("Sensor Number", "Chassis Intrusion") if instance[1] == 6 else ("Index", "Temperature Probe"))
-                self.assertEqual(mox.stderr.data.decode(),
-                                 "MOX: Event reported for %s attribute in the %s group.\n" % (attribute, group), name)
+                console = "MOX: Event reported for %s attribute in the %s group.\n" % (attribute, group)
+                mox.stderr.wait_for(console.encode(), 5)
+                self.assertEqual(mox.stderr.data.decode(), console, name)
             return check
 
         run_in_parallel([case(name, *c) for name, c in cases.items()])
@@ -354,7 +355,9 @@ class EventTest(BedTestCase):
                        "ATTRIBUTE:Unknown Attribute N/A\n")
         self.assertLogged(bed, vendor_line, LOG_INFO, start=start)
         self.assertEqual([e.message for e in bed.log.since(start)], [vendor_line])
-        self.assertEqual(mox.stderr.data, b"MOX: Event reported for Unknown attribute in the Unknown group.\n")
+        console = b"MOX: Event reported for Unknown attribute in the Unknown group.\n"
+        mox.stderr.wait_for(console, 5)  # the pipe may lag behind the log socket
+        self.assertEqual(mox.stderr.data, console)
 
         # The enclosure installed while the daemon runs joins the catalogue,
         # and its events are served.
