@@ -106,10 +106,21 @@ class EventTest(BedTestCase):
     def setUp(self):
         require("MOX_DMICTL", "the provider's client tool")
 
-    def event_bed(self, name, config=None, email=None, kobd=False, extra_components=()):
+    def event_bed(self, name, config=None, email=None, kobd=False, extra_components=(), vendor_rows=()):
         """A running daemon with the sample baseboard installed; returns the
-        bed, the daemon, the component ids and the alarm peer (or None)."""
+        bed, the daemon, the component ids and the alarm peer (or None).
+        `vendor_rows` are added to the vendor actions table of the bed's copy
+        of mox.mif before the daemon installs it."""
         bed = self.bed(name)
+        if vendor_rows:
+            path = os.path.join(bed.paths["mifs"], "mox.mif")
+            with open(path) as f:
+                text = f.read()
+            anchor = "        // Storage enclosure (MIF id 2): error state"
+            self.assertEqual(text.count(anchor), 1)
+            text = text.replace(anchor, "".join("        %s\n" % row for row in vendor_rows) + anchor)
+            with open(path, "w") as f:
+                f.write(text)
         ids = {"baseboard": int(bed.dmictl("install", os.path.join(bed.paths["mifs"], "baseboard.mif")))}
         for label, path in extra_components:
             ids[label] = int(bed.dmictl("install", path))
@@ -291,30 +302,39 @@ class EventTest(BedTestCase):
         #   (1,6,0,1,0,0)            console, log, LCD, broadcast, e-mail
         #   (1,6,1,1,wildcard,0)     the same plus page
         #   (1,2,0,1,wildcard,0)     console, log, LCD
-        # name -> (instance arguments, error state, expected log line and
-        #          priority, broadcast expected, LCD text, page)
+        # and, added for the first case only, an exact row for sensor 2:
+        #   (1,6,2,1,0,0)            beep, console, log
+        # name -> (extra row, instance arguments, error state, expected log
+        #          line and priority, broadcast, LCD text, page, bell)
+        sensor2 = "{ 1, 6, 2, 1, 0, 0, 1, 1, 1, 0, 0, 0, 0, 0, 0, 0, \"\", 0, 0, 0, 0, 0, 1 }"
         cases = {
             "try 1: exact instance and value": (
-                [], "2",
-                ("NAME:Critical COMPONENT:Zorek Tessarin Baseboard GROUP:Unknown Group ROW:Not Applicable "
-                 "ATTRIBUTE:Unknown Attribute N/A\n", LOG_ERR), None, "", "0"),
+                sensor2, ["--instance", 6, "-k", 2], "2",
+                ("NAME:Critical COMPONENT:Zorek Tessarin Baseboard GROUP:Chassis Intrusion ROW:2 "
+                 "ATTRIBUTE:Sensor Number N/A\n", LOG_ERR), None, "", "0", True),
             "try 2: exact instance, any value": (
-                ["--instance", 6, "-k", 1], "1",
+                None, ["--instance", 6, "-k", 1], "1",
                 ("NAME:Warning COMPONENT:Zorek Tessarin Baseboard GROUP:Chassis Intrusion ROW:1 "
-                 "ATTRIBUTE:Sensor Number N/A\n", LOG_WARNING), "Chassis Intrusion", "Check: Chassis Intrusion", "1"),
+                 "ATTRIBUTE:Sensor Number N/A\n", LOG_WARNING), "Chassis Intrusion", "Check: Chassis Intrusion", "1",
+                False),
             "try 3: any instance, exact value": (
-                ["--instance", 6, "-k", 2], "0",
+                None, ["--instance", 6, "-k", 2], "0",
                 ("NAME:Normal COMPONENT:Zorek Tessarin Baseboard GROUP:Chassis Intrusion ROW:2 "
-                 "ATTRIBUTE:Sensor Number N/A\n", LOG_INFO), "Chassis Intrusion", "Check: Chassis Intrusion", "0"),
+                 "ATTRIBUTE:Sensor Number N/A\n", LOG_INFO), "Chassis Intrusion", "Check: Chassis Intrusion", "0",
+                False),
             "try 4: any instance, any value": (
-                ["--instance", 2, "-k", 3], "3",
+                None, ["--instance", 2, "-k", 3], "3",
                 ("NAME:Non-Recoverable COMPONENT:Zorek Tessarin Baseboard GROUP:Temperature Probe "
-                 "ROW:System Board ATTRIBUTE:Index N/A\n", LOG_ERR), None, "Check: Temperature Probe", "0"),
+                 "ROW:System Board ATTRIBUTE:Index N/A\n", LOG_ERR), None, "Check: Temperature Probe", "0", False),
+            "no group row": (
+                None, [], "2",
+                ("NAME:Critical COMPONENT:Zorek Tessarin Baseboard GROUP:Unknown Group ROW:Not Applicable "
+                 "ATTRIBUTE:Unknown Attribute N/A\n", LOG_ERR), None, "", "0", False),
         }
 
-        def case(name, instance, state, line, broadcast, lcd, page):
+        def case(name, extra_row, instance, state, line, broadcast, lcd, page, bell):
             def check():
-                bed, mox, ids, _ = self.event_bed("vendor")
+                bed, mox, ids, _ = self.event_bed("vendor", vendor_rows=[extra_row] if extra_row else [])
                 bed.dmictl("set", ids["baseboard"], 10, 1, state)
                 start = bed.log.mark()
                 bed.dmictl("vendor-event", ids["baseboard"], 10, *instance)
@@ -332,6 +352,7 @@ class EventTest(BedTestCase):
                 console = "MOX: Event reported for %s attribute in the %s group.\n" % (attribute, group)
                 mox.stderr.wait_for(console.encode(), 5)
                 self.assertEqual(mox.stderr.data.decode(), console, name)
+                self.assertEqual(mox.stdout.data, START_LINES + (b"\x07" if bell else b""), name)
             return check
 
         run_in_parallel([case(name, *c) for name, c in cases.items()])
