@@ -200,13 +200,16 @@ class Stream:
 class Process:
     """A process started inside the testbed, with its output collected."""
 
-    def __init__(self, args, env, cwd, stdin=subprocess.DEVNULL):
+    def __init__(self, args, env, cwd, stdin=subprocess.DEVNULL, merge=False):
+        """With `merge` standard error goes into the standard-output pipe, so
+        the two keep the order in which the process wrote them (then
+        `stderr` is the same stream as `stdout`)."""
         self.started = time.monotonic()
-        self.popen = subprocess.Popen(args, env=env, cwd=cwd, stdin=stdin,
-                                      stdout=subprocess.PIPE, stderr=subprocess.PIPE)
+        self.popen = subprocess.Popen(args, env=env, cwd=cwd, stdin=stdin, stdout=subprocess.PIPE,
+                                      stderr=subprocess.STDOUT if merge else subprocess.PIPE)
         self.pid = self.popen.pid
         self.stdout = Stream(self.popen.stdout)
-        self.stderr = Stream(self.popen.stderr)
+        self.stderr = self.stdout if merge else Stream(self.popen.stderr)
         self.ended = None
         self.status = None
         self._done = threading.Event()
@@ -397,10 +400,10 @@ exit 0
     def inside(self, args):
         return ["nsenter", "-t", str(self.holder.pid), "-m", "-n", "--wd=" + self.paths["work"], "--"] + list(args)
 
-    def spawn(self, args, extra_env=None, stdin=subprocess.DEVNULL):
+    def spawn(self, args, extra_env=None, stdin=subprocess.DEVNULL, merge=False):
         """Starts a program inside the namespaces (nsenter execs it, so the
         process id is the program's own)."""
-        process = Process(self.inside(args), self.env(extra_env), self.paths["work"], stdin=stdin)
+        process = Process(self.inside(args), self.env(extra_env), self.paths["work"], stdin=stdin, merge=merge)
         self.processes.append(process)
         return process
 
@@ -409,8 +412,8 @@ exit 0
         return subprocess.run(self.inside(args), env=self.env(extra_env), cwd=self.paths["work"],
                               capture_output=True, timeout=timeout)
 
-    def start_mox(self, extra_env=None):
-        return self.spawn([require("MOX_BIN", "the mox daemon")], extra_env)
+    def start_mox(self, extra_env=None, merge=False):
+        return self.spawn([require("MOX_BIN", "the mox daemon")], extra_env, merge=merge)
 
     def dmictl(self, *args, check=True):
         """Runs the provider's client tool inside the testbed: its standard
