@@ -289,6 +289,28 @@ class EventTest(EventBedCase):
 
         run_in_parallel([case(name, *c) for name, c in cases.items()])
 
+    def test_alarm_peer_under_another_program_name_is_a_stale_lock(self):
+        # kobd started by its full path: its command line does not name
+        # "kobd", so the daemon takes the lock for a stale one and removes the
+        # lock file and the FIFO at the first event; the event's other actions
+        # go on.
+        kobd = require("MOX_KOBD", "the alarm peer kobd")
+        bed, mox, ids, _ = self.event_bed("stale")
+        peer = bed.spawn([kobd])
+        lock, fifo = os.path.join(bed.paths["run"], "kobLock"), "/dev/kob"
+        deadline = time.monotonic() + 10
+        while not os.path.exists(lock) and time.monotonic() < deadline:
+            time.sleep(0.02)
+        self.assertTrue(os.path.exists(lock), peer.stderr.data)
+        self.assertEqual(bed.run(["test", "-p", fifo]).returncode, 0)
+        start = bed.log.mark()
+        bed.dmictl("vendor-event", ids["baseboard"], 10)
+        self.assertLogged(bed, "NAME:Normal COMPONENT:Zorek Tessarin Baseboard GROUP:Unknown Group "
+                               "ROW:Not Applicable ATTRIBUTE:Unknown Attribute N/A\n", LOG_INFO, start=start)
+        self.assertFalse(os.path.exists(lock))
+        self.assertNotEqual(bed.run(["test", "-e", fifo]).returncode, 0, "the FIFO was left")
+        self.assertNotIn(b"alarm ", peer.stdout.data)
+
     def test_unsupported_component_and_component_installed_while_running(self):
         # A component that the supported-components group does not list.
         scratch = tempfile.mkdtemp(prefix="moxe2e-library.")
