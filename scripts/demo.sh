@@ -8,7 +8,7 @@ set -euo pipefail
 cd "$(dirname "$0")/.."
 scripts/setup.sh
 echo "demo: building (the first build takes a minute or two)"
-cmake -S . -B build -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
+cmake -S . -B build -DCMAKE_BUILD_TYPE=RelWithDebInfo -DMOX_BUILD_TESTS=ON >/dev/null
 cmake --build build -j"${JOBS:-2}" --target mox dmisp dmictl kobd obxpreload e2e_initstub >/dev/null
 
 b=$PWD/build
