@@ -10,7 +10,7 @@ import subprocess
 import tempfile
 import unittest
 
-from testbed import LOG_INFO, BedTestCase, require
+from testbed import LOG_INFO, BedTestCase
 
 # Files of the installation, relative to the root; with the file mode they need.
 INSTALLED = {
