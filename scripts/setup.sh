@@ -6,10 +6,14 @@ set -euo pipefail
 # python3-aiosmtpd and postfix: the loopback SMTP servers that the e-mail
 # delivery tests talk to (postfix is installed unconfigured, so no system mail
 # service is set up or started; the tests run a private instance).
+# man-db, groff-base, bsdextrautils (col) and systemd (systemd-analyze): the
+# installation tests render the manual page and verify the unit; systemd is
+# only installed, never started.
 # python3, util-linux (unshare, nsenter), mount, bsdutils (logger) and
-# iproute2: the end-to-end testbed; groff-base: its check of the man page.
+# iproute2: the end-to-end testbed.
 packages=(cmake g++ g++-multilib lib32asan8 lib32ubsan1 googletest file python3-aiosmtpd postfix
-  python3 util-linux mount bsdutils iproute2 groff-base)
+          binutils man-db groff-base bsdextrautils systemd
+          python3 util-linux mount bsdutils iproute2)
 
 missing=()
 for p in "${packages[@]}"; do

@@ -961,21 +961,12 @@ std::string quoted(const std::string& s)
     return out + "\"";
 }
 
+// A value as MIF text: the states and integers as words, the rest quoted.
 std::string literal(const Attribute& a, const Value& v)
 {
-    if (v.state == Value::Unknown)
-        return "unknown";
-    if (v.state == Value::Unsupported)
-        return "unsupported";
-    if (isIntegerType(a.type))
-        return std::to_string(v.number);
-    if (a.type == TypeDate) {
-        std::string t = v.text;
-        while (!t.empty() && t.back() == '\0')
-            t.pop_back();
-        return quoted(t);
-    }
-    return quoted(v.text);
+    if (v.state != Value::Set || isIntegerType(a.type))
+        return valueText(a, v);
+    return quoted(valueText(a, v));
 }
 
 std::string typeText(const Attribute& a)
