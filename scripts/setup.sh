@@ -9,8 +9,11 @@ set -euo pipefail
 # man-db, groff-base, bsdextrautils (col) and systemd (systemd-analyze): the
 # installation tests render the manual page and verify the unit; systemd is
 # only installed, never started.
+# python3, util-linux (unshare, nsenter), mount, bsdutils (logger) and
+# iproute2: the end-to-end testbed.
 packages=(cmake g++ g++-multilib lib32asan8 lib32ubsan1 googletest file python3-aiosmtpd postfix
-          binutils man-db groff-base bsdextrautils systemd)
+          binutils man-db groff-base bsdextrautils systemd
+          python3 util-linux mount bsdutils iproute2)
 
 missing=()
 for p in "${packages[@]}"; do

@@ -1,0 +1,359 @@
+"""Events through the real daemon: raised by the substitute provider, matched in
+the daemon's actions tables, and carried out on every channel a person or the
+machine sees (standard error and output, system log, alarm peer, e-mail, the
+baseboard's LCD, paging and ID-LED groups, the simulated management
+controller)."""
+
+import os
+import shutil
+import socket
+import struct
+import tempfile
+import threading
+import time
+
+from testbed import LOG_EMERG, LOG_ERR, LOG_INFO, LOG_WARNING, BedTestCase, require, run_in_parallel
+
+MOX_COMPONENT = "Zorek Tessarin Server Manager - Mox"
+BASEBOARD = "Zorek Tessarin Baseboard"
+START_LINES = (b"Checking for mox configurations ..\n"
+               b"There is no floppy found in floppy drive\n"
+               b"Proceeding with loading mox ..\n")
+INSTALLED = "MOX - installed mox.mif\n"
+# Keys of the standard actions row for a critical baseboard temperature on
+# any probe: MIF id, event group, event type, instance, 0, severity, system,
+# subsystem.
+TEMPERATURE_CRITICAL_ROW = [1, 20, 3, 0, 0, 0, 2, 2]
+# Action switches (attribute ids of an actions row).
+BEEP, CONSOLE, LOG, LCD, SHUTDOWN_OS, RESET, BROADCAST, PAGE, EMAIL, LED_BLINK = 7, 8, 9, 10, 11, 15, 16, 19, 20, 22
+TEMPERATURE_LINE = ("TYPE:Temperature Critical COMPONENT:Zorek Tessarin Baseboard GROUP:Temperature Probe "
+                    "SEVERITY:Critical ROW:CPU 1 SYSTEM:Environment SUBSYSTEM:Temperature Sensor\n")
+TEMPERATURE_CONSOLE = b'MOX: Event type "Temperature Critical" reported for "Temperature Probe" group.\n'
+TEMPERATURE_BROADCAST = "Please check group Temperature Probe on this machine\n\n"
+
+
+def keys(values):
+    return [arg for v in values for arg in ("-k", str(v))]
+
+
+def alarm(component, group, event_group, severity, instance, power):
+    """The 28-byte record the daemon writes to the alarm peer, as kobd prints it."""
+    return struct.pack("<B3xIIIIIB3x", 1, component, group, event_group, severity, instance, power).hex()
+
+
+def listening(pid, port, timeout):
+    """True once a TCP socket of the network namespace of `pid` listens on `port`."""
+    deadline = time.monotonic() + timeout
+    while time.monotonic() < deadline:
+        try:
+            with open("/proc/%d/net/tcp" % pid) as f:
+                for line in f.readlines()[1:]:
+                    fields = line.split()
+                    if fields[1].endswith(":%04X" % port) and fields[3] == "0A":
+                        return True
+        except OSError:
+            return False
+        time.sleep(0.05)
+    return False
+
+
+class Sampler:
+    """Samples the baseboard groups the actions write (LCD, paging, ID LED)
+    and the simulated controller's log while a scenario runs, with times."""
+
+    def __init__(self, bed, baseboard, period=0.2):
+        self.bed, self.baseboard, self.period = bed, baseboard, period
+        self.samples = []   # (time, lcd, page, led)
+        self.obx = []       # (time, line)
+        self.stop = threading.Event()
+        self.thread = threading.Thread(target=self._run, daemon=True)
+        self.thread.start()
+
+    def _value(self, group, attribute):
+        code, out, _ = self.bed.dmictl("get", self.baseboard, group, attribute, check=False)
+        return out[:-1] if code == 0 else None
+
+    def _run(self):
+        while not self.stop.is_set():
+            lines = self.bed.obx_log()
+            now = time.monotonic()
+            for line in lines[len(self.obx):]:
+                self.obx.append((now, line))
+            self.samples.append((time.monotonic(), self._value(30, 8), self._value(32, 6), self._value(31, 25)))
+            self.stop.wait(self.period)
+
+    def obx_time(self, line, timeout):
+        deadline = time.monotonic() + timeout
+        while True:
+            for at, seen in list(self.obx):
+                if seen == line:
+                    return at
+            if time.monotonic() >= deadline:
+                return None
+            time.sleep(0.05)
+
+    def close(self):
+        self.stop.set()
+        self.thread.join()
+
+
+class EventBedCase(BedTestCase):
+    """Helpers of the event scenarios: a daemon beside the sample baseboard."""
+
+    def setUp(self):
+        require("MOX_DMICTL", "the provider's client tool")
+
+    def event_bed(self, name, config=None, email=None, kobd=False, extra_components=(), vendor_rows=(),
+                  merge=False):
+        """A running daemon with the sample baseboard installed; returns the
+        bed, the daemon, the component ids and the alarm peer (or None).
+        `vendor_rows` are added to the vendor actions table of the bed's copy
+        of mox.mif before the daemon installs it."""
+        bed = self.bed(name)
+        if vendor_rows:
+            path = os.path.join(bed.paths["mifs"], "mox.mif")
+            with open(path) as f:
+                text = f.read()
+            anchor = "        // Storage enclosure (MIF id 2): error state"
+            self.assertEqual(text.count(anchor), 1)
+            text = text.replace(anchor, "".join("        %s\n" % row for row in vendor_rows) + anchor)
+            with open(path, "w") as f:
+                f.write(text)
+        ids = {"baseboard": int(bed.dmictl("install", os.path.join(bed.paths["mifs"], "baseboard.mif")))}
+        for label, path in extra_components:
+            ids[label] = int(bed.dmictl("install", path))
+        if email:
+            for attribute, value in email.items():
+                bed.dmictl("set", ids["baseboard"], 1012, attribute, value)
+        if config is not None:
+            bed.write("cfg", "mox.cfg", config)
+        peer = bed.start_kobd() if kobd else None
+        mox = bed.start_mox(merge=merge)
+        self.assertLogged(bed, INSTALLED, LOG_INFO)
+        self.assertTrue(bed.wait_registered(), "start-up did not settle: %r" % mox.stderr.data)
+        ids["mox"] = bed.component_id(MOX_COMPONENT)
+        return bed, mox, ids, peer
+
+    def critical_temperature(self, bed, ids, switches):
+        """Makes the baseboard's temperature event critical and switches the
+        given actions on in its actions row (an administrator's change)."""
+        bed.dmictl("set", ids["baseboard"], 20, 1, "3")   # Temperature Critical
+        bed.dmictl("set", ids["baseboard"], 20, 2, "16")  # severity Critical
+        for attribute in switches:
+            bed.dmictl("set", ids["mox"], 10, attribute, "1", *keys(TEMPERATURE_CRITICAL_ROW))
+
+    def raise_temperature(self, bed, ids):
+        # The event names probe 1 of the temperature table as its instance.
+        bed.dmictl("event", ids["baseboard"], 20, "--instance", 2, "-k", 1)
+
+
+
+class EventTest(EventBedCase):
+
+    def test_road_of_one_standard_event(self):
+        require("MOX_KOBD", "the alarm peer kobd")
+        require("MOX_OBX_PRELOAD", "the simulated OBX driver")
+        bed, mox, ids, peer = self.event_bed(
+            "road", kobd=True, email={1: "127.0.0.1", 3: "ops@example.org;duty@example.org"}, merge=True)
+        bed.start_smtp()
+        self.critical_temperature(bed, ids, [BEEP, PAGE, LED_BLINK, RESET])
+        sampler = Sampler(bed, ids["baseboard"])
+        self.addCleanup(sampler.close)
+        log_start = bed.log.mark()
+        raised = time.monotonic()
+        self.raise_temperature(bed, ids)
+
+        started = sampler.obx_time("watchdog started: countdown 1", 30)
+        self.assertIsNotNone(started, "no reset: %r; stderr %r" % (bed.obx_log(), mox.stderr.data))
+        expired = sampler.obx_time("watchdog expired: hard reset", 3)
+        sampler.close()
+        host = socket.gethostname()
+
+        # Console line, then the bell (standard error and output share one
+        # pipe here, so their order is the daemon's).
+        self.assertEqual(mox.stdout.data, START_LINES + TEMPERATURE_CONSOLE + b"\x07")
+        # The alarm record: component, table group 2 (the instance's), event
+        # group 20, severity 16, instance 1, no power group.
+        self.assertTrue(peer.stdout.wait_for(b"\n", 2))
+        lines = [l for l in peer.stdout.data.decode().splitlines() if l.startswith("alarm ")]
+        self.assertEqual([l.split()[1] for l in lines], [alarm(ids["baseboard"], 2, 20, 16, 1, 0)], lines)
+        # System log: the event line at its severity's priority, then the
+        # broadcast at LOG_EMERG, and nothing else from the daemon.
+        entries = bed.log.since(log_start)
+        self.assertEqual([(e.level, e.facility, e.message) for e in entries],
+                         [(LOG_ERR, 1, TEMPERATURE_LINE), (LOG_EMERG, 1, TEMPERATURE_BROADCAST)])
+        # The e-mail.
+        sessions = bed.smtp_sessions(1, 5)
+        self.assertEqual(len(sessions), 1)
+        session = sessions[0]
+        received = [c["received"] for c in session["commands"] if "received" in c]
+        self.assertEqual(received, ["HELO 127.0.0.1", "MAIL FROM:<admin@%s>" % host, "RCPT TO:<ops@example.org>",
+                                    "RCPT TO:<duty@example.org>", "DATA", "QUIT"])
+        self.assertEqual(session["data"],
+                         "SUBJECT:Zorek Server Management Alert:%s\r\n"
+                         "Check Temperature Probe at server %s\r\n"
+                         "Event Type:Temperature Critical\r\n"
+                         "Event Severity:Critical\r\n"
+                         "Component:Zorek Tessarin Baseboard\r\n"
+                         "Group:Temperature Probe\r\n"
+                         "Instance:CPU 1\r\n" % (host, host))
+        self.assertEqual(session["unread"], "")
+        # No server answers the subject line: the client waits 8 s for it.
+        data_at = next(c["at"] for c in session["commands"] if c.get("received") == "DATA")
+        quit_at = next(c["at"] for c in session["commands"] if c.get("received") == "QUIT")
+        self.assertGreaterEqual(quit_at - data_at, 8.0)
+        # LCD, page and ID LED in the baseboard's groups.
+        self.assertEqual(bed.dmictl("get", ids["baseboard"], 30, 8), "Check: Temperature Probe".ljust(32) + "\n")
+        self.assertEqual(bed.dmictl("get", ids["baseboard"], 32, 6), "1\n")   # Page
+        self.assertEqual(bed.dmictl("get", ids["baseboard"], 31, 25), "2\n")  # LED Blink
+        # Run order: while the e-mail was on its way the LCD already showed
+        # the text and neither page nor LED had been written; both were
+        # written before the reset started.
+        during_mail = [s for s in sampler.samples if data_at + 0.5 < s[0] < quit_at - 0.5]
+        self.assertTrue(during_mail)
+        for _, lcd, page, led in during_mail:
+            self.assertEqual((lcd, page, led), ("Check: Temperature Probe".ljust(32), "0", "0"))
+        armed = sampler.obx_time("watchdog set: use 0x04 action hard reset countdown 1", 0)
+        self.assertIsNotNone(armed, bed.obx_log())
+        self.assertGreater(armed, quit_at)
+        self.assertTrue(any(s[2:] == ("1", "2") and s[0] < started for s in sampler.samples), sampler.samples)
+        # The reset: armed with a 100 ms countdown, started after the 3 s
+        # wait, and the simulated controller resets the machine.
+        self.assertGreaterEqual(started - armed, 2.8)
+        self.assertIsNotNone(expired, bed.obx_log())
+        requests = [l for l in bed.obx_log() if l.startswith("watchdog") or l.startswith("chassis")]
+        self.assertEqual(requests, ["watchdog set: use 0x04 action hard reset countdown 1",
+                                    "watchdog started: countdown 1", "watchdog expired: hard reset"])
+        self.assertGreater(armed, raised)
+
+    def test_vendor_events_by_each_lookup(self):
+        # The baseboard's vendor rows (group 4 of mox.mif), keys MIF id,
+        # group, instance, attribute, value, error state; for the baseboard
+        # value and state are looked up as 0 or the wildcard.
+        #   (1,0,0,0,0,0)            console, log
+        #   (1,6,0,1,0,0)            console, log, LCD, broadcast, e-mail
+        #   (1,6,1,1,wildcard,0)     the same plus page
+        #   (1,2,0,1,wildcard,0)     console, log, LCD
+        # and, added for the first case only, an exact row for sensor 2:
+        #   (1,6,2,1,0,0)            beep, console, log
+        # name -> (extra row, instance arguments, error state, expected log
+        #          line and priority, broadcast, LCD text, page, bell)
+        sensor2 = "{ 1, 6, 2, 1, 0, 0, 1, 1, 1, 0, 0, 0, 0, 0, 0, 0, \"\", 0, 0, 0, 0, 0, 1 }"
+        cases = {
+            "try 1: exact instance and value": (
+                sensor2, ["--instance", 6, "-k", 2], "2",
+                ("NAME:Critical COMPONENT:Zorek Tessarin Baseboard GROUP:Chassis Intrusion ROW:2 "
+                 "ATTRIBUTE:Sensor Number N/A\n", LOG_ERR), None, "", "0", True),
+            "try 2: exact instance, any value": (
+                None, ["--instance", 6, "-k", 1], "1",
+                ("NAME:Warning COMPONENT:Zorek Tessarin Baseboard GROUP:Chassis Intrusion ROW:1 "
+                 "ATTRIBUTE:Sensor Number N/A\n", LOG_WARNING), "Chassis Intrusion", "Check: Chassis Intrusion", "1",
+                False),
+            "try 3: any instance, exact value": (
+                None, ["--instance", 6, "-k", 2], "0",
+                ("NAME:Normal COMPONENT:Zorek Tessarin Baseboard GROUP:Chassis Intrusion ROW:2 "
+                 "ATTRIBUTE:Sensor Number N/A\n", LOG_INFO), "Chassis Intrusion", "Check: Chassis Intrusion", "0",
+                False),
+            "try 4: any instance, any value": (
+                None, ["--instance", 2, "-k", 3], "3",
+                ("NAME:Non-Recoverable COMPONENT:Zorek Tessarin Baseboard GROUP:Temperature Probe "
+                 "ROW:System Board ATTRIBUTE:Index N/A\n", LOG_ERR), None, "Check: Temperature Probe", "0", False),
+            "no group row": (
+                None, [], "2",
+                ("NAME:Critical COMPONENT:Zorek Tessarin Baseboard GROUP:Unknown Group ROW:Not Applicable "
+                 "ATTRIBUTE:Unknown Attribute N/A\n", LOG_ERR), None, "", "0", False),
+        }
+
+        def case(name, extra_row, instance, state, line, broadcast, lcd, page, bell):
+            def check():
+                bed, mox, ids, _ = self.event_bed("vendor", vendor_rows=[extra_row] if extra_row else [])
+                bed.dmictl("set", ids["baseboard"], 10, 1, state)
+                start = bed.log.mark()
+                bed.dmictl("vendor-event", ids["baseboard"], 10, *instance)
+                entry = bed.log.wait_for(line[0], 10, start=start)
+                self.assertIsNotNone(entry, "%s: %r" % (name, bed.log.snapshot()[start:]))
+                self.assertEqual(entry.level, line[1], name)
+                time.sleep(0.5)
+                others = [e.message for e in bed.log.since(start) if e.message != line[0]]
+                self.assertEqual(others, ["Please check group %s on this machine\n\n" % broadcast] if broadcast else [],
+                                 name)
+                self.assertEqual(bed.dmictl("get", ids["baseboard"], 30, 8), lcd.ljust(32) + "\n", name)
+                self.assertEqual(bed.dmictl("get", ids["baseboard"], 32, 6), page + "\n", name)
+                attribute, group = ("Unknown", "Unknown") if not instance else (
+                    ("Sensor Number", "Chassis Intrusion") if instance[1] == 6 else ("Index", "Temperature Probe"))
+                console = "MOX: Event reported for %s attribute in the %s group.\n" % (attribute, group)
+                mox.stderr.wait_for(console.encode(), 5)
+                self.assertEqual(mox.stderr.data.decode(), console, name)
+                self.assertEqual(mox.stdout.data, START_LINES + (b"\x07" if bell else b""), name)
+            return check
+
+        run_in_parallel([case(name, *c) for name, c in cases.items()])
+
+    def test_alarm_peer_under_another_program_name_is_a_stale_lock(self):
+        # kobd started by its full path: its command line does not name
+        # "kobd", so the daemon takes the lock for a stale one and removes the
+        # lock file and the FIFO at the first event; the event's other actions
+        # go on.
+        kobd = require("MOX_KOBD", "the alarm peer kobd")
+        bed, mox, ids, _ = self.event_bed("stale")
+        peer = bed.spawn([kobd])
+        lock, fifo = os.path.join(bed.paths["run"], "kobLock"), "/dev/kob"
+        deadline = time.monotonic() + 10
+        while not os.path.exists(lock) and time.monotonic() < deadline:
+            time.sleep(0.02)
+        self.assertTrue(os.path.exists(lock), peer.stderr.data)
+        self.assertEqual(bed.run(["test", "-p", fifo]).returncode, 0)
+        start = bed.log.mark()
+        bed.dmictl("vendor-event", ids["baseboard"], 10)
+        self.assertLogged(bed, "NAME:Normal COMPONENT:Zorek Tessarin Baseboard GROUP:Unknown Group "
+                               "ROW:Not Applicable ATTRIBUTE:Unknown Attribute N/A\n", LOG_INFO, start=start)
+        self.assertFalse(os.path.exists(lock))
+        self.assertNotEqual(bed.run(["test", "-e", fifo]).returncode, 0, "the FIFO was left")
+        self.assertNotIn(b"alarm ", peer.stdout.data)
+
+    def test_unsupported_component_and_component_installed_while_running(self):
+        # A component that the supported-components group does not list.
+        scratch = tempfile.mkdtemp(prefix="moxe2e-library.")
+        self.addCleanup(shutil.rmtree, scratch, True)
+        with open(os.path.join(os.environ["MOX_SOURCE_DIR"], "mifs", "enclosure.mif")) as f:
+            text = f.read()
+        self.assertIn("Zorek Tessarin Storage Enclosure", text)
+        library = os.path.join(scratch, "library.mif")
+        with open(library, "w") as f:
+            f.write(text.replace("Zorek Tessarin Storage Enclosure", "Zorek Tessarin Tape Library"))
+        bed, mox, ids, peer = self.event_bed("catalogue", kobd=True, extra_components=[("library", library)])
+        start = bed.log.mark()
+        bed.dmictl("event", ids["library"], 20, "--instance", 2, "-k", 1)
+        # A supported event behind it shows when the first has been handled.
+        bed.dmictl("vendor-event", ids["baseboard"], 10)
+        vendor_line = ("NAME:Normal COMPONENT:Zorek Tessarin Baseboard GROUP:Unknown Group ROW:Not Applicable "
+                       "ATTRIBUTE:Unknown Attribute N/A\n")
+        self.assertLogged(bed, vendor_line, LOG_INFO, start=start)
+        self.assertEqual([e.message for e in bed.log.since(start)], [vendor_line])
+        console = b"MOX: Event reported for Unknown attribute in the Unknown group.\n"
+        mox.stderr.wait_for(console, 5)  # the pipe may lag behind the log socket
+        self.assertEqual(mox.stderr.data, console)
+
+        # The enclosure installed while the daemon runs joins the catalogue,
+        # and its events are served.
+        enclosure = int(bed.dmictl("install", os.path.join(bed.paths["mifs"], "enclosure.mif")))
+        time.sleep(0.5)  # the install indication reaches the daemon first
+        start = bed.log.mark()
+        bed.dmictl("event", enclosure, 20, "--instance", 2, "-k", 1)
+        drive_line = ("TYPE:Drive Failed COMPONENT:Zorek Tessarin Storage Enclosure GROUP:Drive Bay "
+                      "SEVERITY:Critical ROW:Bay 1 SYSTEM:Storage SUBSYSTEM:Disk Drive\n")
+        self.assertLogged(bed, drive_line, LOG_ERR, start=start)
+        self.assertLogged(bed, "Please check group Drive Bay on this machine\n\n", LOG_EMERG, start=start)
+        self.assertEqual(bed.dmictl("get", ids["baseboard"], 30, 8), "Check: Drive Bay".ljust(32) + "\n")
+        self.assertTrue(mox.stderr.wait_for(b'MOX: Event type "Drive Failed" reported for "Drive Bay" group.\n', 2))
+        # Alarm records: the baseboard's vendor event (group 0) and the
+        # enclosure's drive event (table group 2, event group 20, severity
+        # 16, bay 1); none for the unsupported component.
+        self.assertTrue(peer.stdout.wait_for(b"instance=1", 2), peer.stdout.data)
+        lines = [l.split()[1] for l in peer.stdout.data.decode().splitlines() if l.startswith("alarm ")]
+        self.assertEqual(lines, [alarm(ids["baseboard"], 0, 0, 0, 0, 0), alarm(enclosure, 2, 20, 16, 1, 0)])
+
+
+if __name__ == "__main__":
+    import unittest
+    unittest.main()

@@ -1,0 +1,201 @@
+"""Registration of the real daemon with the substitute DMI provider: its own MIF
+installed into an empty database, refusal, a missing MIF, and the carry-over of
+an older MIF's actions table."""
+
+import fcntl
+import os
+import shutil
+import subprocess
+import tempfile
+import time
+
+from testbed import LOG_ERR, LOG_INFO, BedTestCase, require, run_in_parallel
+
+MOX_COMPONENT = "Zorek Tessarin Server Manager - Mox"
+START_LINES = ("Checking for mox configurations ..\n"
+               "There is no floppy found in floppy drive\n"
+               "Proceeding with loading mox ..\n")
+INSTALLED = "MOX - installed mox.mif\n"
+# Integer attributes of an actions-table row that the carry-over keeps:
+# the action switches (17 is the alert name, a string) and the enable flag.
+SWITCHES = [a for a in range(7, 23) if a != 17] + [30]
+
+
+def wait_until(condition, timeout, step=0.1):
+    deadline = time.monotonic() + timeout
+    while True:
+        value = condition()
+        if value or time.monotonic() > deadline:
+            return value
+        time.sleep(step)
+
+
+class RegistrationTest(BedTestCase):
+
+    def setUp(self):
+        require("MOX_DMICTL", "the provider's client tool")
+
+    def test_empty_database_gets_mox_mif_and_a_restart_keeps_it(self):
+        bed = self.bed("register")
+        mox = bed.start_mox()
+        self.assertLogged(bed, INSTALLED, LOG_INFO)
+        time.sleep(1.0)
+        self.assertTrue(mox.running(), "status %s, stderr %r" % (mox.status, mox.stderr.data))
+        self.assertEqual(mox.stdout.data.decode(), START_LINES)
+        component = bed.component_id(MOX_COMPONENT)
+        self.assertIsNotNone(component, bed.dmictl("list"))
+        self.assertEqual(bed.dmictl("get", component, 1, 3), "2.93\n")
+        # The daemon registered once with the provider that serves it.
+        self.assertIn("registrations\t1\n", bed.dmictl("status"))
+        mox.kill()
+
+        # A second start finds the MIF current: nothing installed, nothing
+        # migrated (a migration reinstalls and so changes the component id).
+        before = bed.log.snapshot("mox")
+        again = bed.start_mox()
+        self.assertTrue(again.stdout.wait_for(b"Proceeding with loading mox ..\n", 10))
+        self.assertTrue(wait_until(lambda: "registrations\t1\n" in bed.dmictl("status", check=False)[1], 10))
+        time.sleep(1.0)
+        self.assertTrue(again.running(), again.stderr.data)
+        self.assertEqual(bed.component_id(MOX_COMPONENT), component)
+        self.assertEqual([e.message for e in bed.log.snapshot("mox")[len(before):]],
+                         ["\n" + START_LINES.splitlines(True)[0]] + START_LINES.splitlines(True)[1:])
+        again.kill()
+
+    def test_initialisation_failures(self):
+        def refused():
+            # The provider refuses every command while another provider
+            # holds its database: registration fails with 2.
+            bed = self.bed("refused")
+            lock = os.open(bed.paths["db"], os.O_RDONLY | os.O_DIRECTORY)
+            self.addCleanup(os.close, lock)
+            fcntl.flock(lock, fcntl.LOCK_EX)
+            self.failure(bed, 2)
+
+        def no_mif():
+            # No mox.mif where the daemon installs MIFs from: 3.
+            bed = self.bed("nomif", mifs=False)
+            self.failure(bed, 3)
+
+        run_in_parallel([refused, no_mif])
+
+    def failure(self, bed, code):
+        mox = bed.start_mox()
+        status = mox.wait(15)
+        line = "mox: initialization failed, return code = 0x%x" % code
+        self.assertEqual(status, 1, mox.stderr.data)
+        self.assertEqual(mox.stdout.data.decode(), START_LINES + "MOX ERROR, " + line + "\n")
+        self.assertLogged(bed, line + "\n", LOG_ERR)
+        self.assertEqual(bed.log.snapshot("mox")[-1].message, line + "\n")
+        if code == 3:
+            self.assertEqual(bed.dmictl("list"), "")
+
+    def test_carry_over_of_older_actions_tables(self):
+        # version -> (table group in the old MIF, group written in the new,
+        #             keys of the old rows mapped to those of the new)
+        cases = {
+            "2.40": (3, 4, lambda keys: keys + ["0"]),
+            "2.60": (4, 4, lambda keys: keys),
+            "2.92": (10, 10, lambda keys: keys),
+        }
+        # The tables of a freshly installed current MIF, the defaults.
+        defaults = self.fresh_tables()
+
+        def case(version, old_group, new_group, new_keys):
+            def check():
+                bed = self.bed("carry")
+                old_file = os.path.join(bed.paths["scratch"], "mox-%s.mif" % version)
+                shutil.copy(os.path.join(bed.paths["mifs"], "old", "mox-%s.mif" % version), old_file)
+                old_id = int(bed.dmictl("install", old_file))
+                old_rows = bed.table(old_id, old_group)
+                self.assertTrue(old_rows, version)
+                # An administrator's change in the old table must survive too.
+                first = old_rows[0]
+                key_ids = self.key_ids(bed, old_id, old_group)
+                keys = [arg for k in key_ids for arg in ("-k", first[k])]
+                bed.dmictl("set", old_id, old_group, 7, "7", *keys)
+                old_rows = bed.table(old_id, old_group)
+
+                mox = bed.start_mox()
+                new_id = wait_until(lambda: self.current_mox(bed), 15)
+                self.assertTrue(new_id, "%s: mox.mif 2.93 never appeared; %s" % (version, mox.stderr.data))
+                self.assertNotEqual(new_id, old_id, version)
+                self.assertEqual(len(bed.dmictl("list").splitlines()), 1, version)
+
+                expected = [dict(row) for row in defaults[new_group]]
+                new_key_ids = self.key_ids(bed, new_id, new_group)
+                for old in old_rows:
+                    mapped = new_keys([old[k] for k in key_ids])
+                    for row in expected:
+                        if [row[k] for k in new_key_ids] == mapped:
+                            for a in SWITCHES:
+                                source = 6 if (a == 30 and old_group == 3) else a
+                                if source in old:
+                                    row[a] = old[source]
+                            break
+                # The old table differs from the new defaults (at least by the
+                # change made above), so the check below can tell.
+                self.assertNotEqual(expected, defaults[new_group], version)
+                # The write-back follows the reinstall; let it finish.
+                wait_until(lambda: bed.table(new_id, new_group) == expected, 10)
+                self.assertEqual(bed.table(new_id, new_group), expected, version)
+                other = 10 if new_group == 4 else 4
+                self.assertEqual(bed.table(new_id, other), defaults[other], version)
+                self.assertIsNone(bed.log.wait_for(INSTALLED, 0), version)
+                mox.kill()
+
+                # The next start migrates nothing.
+                again = bed.start_mox()
+                self.assertTrue(again.stdout.wait_for(b"Proceeding with loading mox ..\n", 10))
+                self.assertTrue(wait_until(
+                    lambda: "registrations\t1\n" in bed.dmictl("status", check=False)[1], 10), version)
+                time.sleep(1.0)
+                self.assertTrue(again.running(), version)
+                self.assertEqual(self.current_mox(bed), new_id, version)
+                self.assertEqual(bed.table(new_id, new_group), expected, version)
+                again.kill()
+            return check
+
+        run_in_parallel([case(v, *c) for v, c in cases.items()])
+
+    @staticmethod
+    def current_mox(bed):
+        """The own component's id once its version reads 2.93, else None."""
+        code, out, _ = bed.dmictl("list", check=False)
+        for line in out.splitlines() if code == 0 else []:
+            cid, _, name = line.partition("\t")
+            if name == MOX_COMPONENT:
+                code, version, _ = bed.dmictl("get", cid, 1, 3, check=False)
+                if code == 0 and version == "2.93\n":
+                    return int(cid)
+        return None
+
+    @staticmethod
+    def key_ids(bed, component, group):
+        for line in bed.dmictl("groups", component).splitlines():
+            fields = line.split("\t")
+            if int(fields[0]) == group:
+                return [int(k) for k in fields[3].split()[1:]]
+        raise AssertionError("group %d not listed" % group)
+
+    def fresh_tables(self):
+        tool = require("MOX_DMICTL", "the provider's client tool")
+        scratch = tempfile.mkdtemp(prefix="moxe2e-fresh.")
+        self.addCleanup(shutil.rmtree, scratch, True)
+        source = os.path.join(os.environ["MOX_SOURCE_DIR"], "mifs", "mox.mif")
+        env = {k: v for k, v in os.environ.items() if not k.startswith("DMISP_")}
+
+        def dmictl(*args):
+            return subprocess.run([tool, "--db", scratch + "/db"] + [str(a) for a in args], check=True,
+                                  capture_output=True, env=env).stdout.decode()
+        cid = dmictl("install", source).strip()
+        tables = {}
+        for group in (4, 10):
+            ids = [int(line.split("\t")[0]) for line in dmictl("attributes", cid, group).splitlines()]
+            tables[group] = [dict(zip(ids, line.split("\t"))) for line in dmictl("rows", cid, group).splitlines()]
+        return tables
+
+
+if __name__ == "__main__":
+    import unittest
+    unittest.main()
