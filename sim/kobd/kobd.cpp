@@ -12,6 +12,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
+#include <string>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -59,14 +60,17 @@ int main(int argc, char** argv)
         fprintf(stderr, "kobd: cannot make %s: %s\n", fifo, strerror(errno));
         return 1;
     }
-    FILE* lock = fopen(lockFile, "w");
-    if (lock == nullptr) {
+    // The lock appears complete (written aside, then renamed): a reader never
+    // sees it empty, which it would take for a stale lock.
+    std::string partial = std::string(lockFile) + ".new";
+    FILE* lock = fopen(partial.c_str(), "w");
+    if (lock == nullptr || fprintf(lock, "%d\n", static_cast<int>(getpid())) < 0 || fclose(lock) != 0 ||
+        rename(partial.c_str(), lockFile) != 0) {
         fprintf(stderr, "kobd: cannot write %s: %s\n", lockFile, strerror(errno));
+        unlink(partial.c_str());
         unlink(fifo);
         return 1;
     }
-    fprintf(lock, "%d\n", static_cast<int>(getpid()));
-    fclose(lock);
     printf("kobd: pid %d, reading %s\n", static_cast<int>(getpid()), fifo);
     fflush(stdout);
 
