@@ -59,28 +59,39 @@ def listening(pid, port, timeout):
 
 class Sampler:
     """Samples the baseboard groups the actions write (LCD, paging, ID LED)
-    and the simulated controller's log while a scenario runs, with times."""
+    and the simulated controller's log while a scenario runs, with times.
+
+    The controller's log is tailed every 20 ms on a thread of its own, so a
+    line's time is at most that late; a sample of the groups is stamped once
+    its values have been read, so its values were there at its time."""
 
     def __init__(self, bed, baseboard, period=0.2):
         self.bed, self.baseboard, self.period = bed, baseboard, period
         self.samples = []   # (time, lcd, page, led)
         self.obx = []       # (time, line)
         self.stop = threading.Event()
-        self.thread = threading.Thread(target=self._run, daemon=True)
-        self.thread.start()
+        self.threads = [threading.Thread(target=self._groups, daemon=True),
+                        threading.Thread(target=self._controller, daemon=True)]
+        for thread in self.threads:
+            thread.start()
 
     def _value(self, group, attribute):
         code, out, _ = self.bed.dmictl("get", self.baseboard, group, attribute, check=False)
         return out[:-1] if code == 0 else None
 
-    def _run(self):
+    def _groups(self):
+        while not self.stop.is_set():
+            values = (self._value(30, 8), self._value(32, 6), self._value(31, 25))
+            self.samples.append((time.monotonic(),) + values)
+            self.stop.wait(self.period)
+
+    def _controller(self):
         while not self.stop.is_set():
             lines = self.bed.obx_log()
             now = time.monotonic()
             for line in lines[len(self.obx):]:
                 self.obx.append((now, line))
-            self.samples.append((time.monotonic(), self._value(30, 8), self._value(32, 6), self._value(31, 25)))
-            self.stop.wait(self.period)
+            self.stop.wait(0.02)
 
     def obx_time(self, line, timeout):
         deadline = time.monotonic() + timeout
@@ -90,11 +101,12 @@ class Sampler:
                     return at
             if time.monotonic() >= deadline:
                 return None
-            time.sleep(0.05)
+            time.sleep(0.02)
 
     def close(self):
         self.stop.set()
-        self.thread.join()
+        for thread in self.threads:
+            thread.join()
 
 
 class EventBedCase(BedTestCase):
