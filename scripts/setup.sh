@@ -6,7 +6,8 @@ set -euo pipefail
 # python3-aiosmtpd and postfix: the loopback SMTP servers that the e-mail
 # delivery tests talk to (postfix is installed unconfigured, so no system mail
 # service is set up or started; the tests run a private instance).
-packages=(cmake g++ g++-multilib lib32asan8 lib32ubsan1 googletest file python3-aiosmtpd postfix)
+# clang-14 and libclang-rt-14-dev: the fuzz targets (libFuzzer, i386 runtime).
+packages=(cmake g++ g++-multilib lib32asan8 lib32ubsan1 googletest file python3-aiosmtpd postfix clang-14 libclang-rt-14-dev)
 
 missing=()
 for p in "${packages[@]}"; do

@@ -21,6 +21,8 @@ pthread_mutex_t Dmi_Mutex1 = PTHREAD_MUTEX_INITIALIZER; // held for the whole of
 std::atomic<uint32_t> iMgmtHandle{0};
 std::atomic<uint32_t> iCmdHandle{0};
 std::atomic<int> cleanup{0};
+// Commands inside SLSynchronousExecute, running or waiting for Dmi_Mutex1.
+std::atomic<int> commandsInside{0};
 
 // Command codes.
 enum : uint32_t {
@@ -222,8 +224,11 @@ int SLInitialize(void)
 int SLCleanup(void)
 {
     cleanup = 1;
-    // A command still in progress ends its wait on the flag; let it leave
-    // before its handle is freed and the mutex it holds is destroyed.
+    // A command still in progress ends its wait on the flag; let it, and every
+    // command queued behind it on the mutex, leave before their handles are
+    // freed and the mutex is destroyed.
+    while (commandsInside.load() != 0)
+        sched_yield();
     pthread_mutex_lock(&Dmi_Mutex1);
     pthread_mutex_unlock(&Dmi_Mutex1);
     SLHandleCleanup();
@@ -232,7 +237,9 @@ int SLCleanup(void)
     return pthread_mutex_destroy(&Dmi_Mutex1);
 }
 
-int SLSynchronousExecute(SLHandle* h)
+namespace {
+
+int synchronousExecute(SLHandle* h)
 {
     SLInvokeFunction invoke = SLDmiInvoke;
     if (invoke == nullptr || h == nullptr)
@@ -255,6 +262,13 @@ int SLSynchronousExecute(SLHandle* h)
         word(h, 4, iCmdHandle.fetch_add(1));
 
     pthread_mutex_lock(&Dmi_Mutex1);
+    if (cleanup.load() != 0) {
+        // Cleanup has begun: a command that waited for the lock is not sent,
+        // since its confirm could arrive after its handle was freed.
+        word(h, 11, statusAbandoned);
+        pthread_mutex_unlock(&Dmi_Mutex1);
+        return 1;
+    }
     uint32_t result = invoke(h->command);
     if (result == statusBusy) {
         moxSleepMs(busySleepMs);
@@ -275,6 +289,16 @@ int SLSynchronousExecute(SLHandle* h)
     uint32_t status = readWord(h, 11);
     pthread_mutex_unlock(&Dmi_Mutex1);
     return (status == 0 || status == 1) ? 0 : 1;
+}
+
+} // namespace
+
+int SLSynchronousExecute(SLHandle* h)
+{
+    ++commandsInside;
+    int rc = synchronousExecute(h);
+    --commandsInside;
+    return rc;
 }
 
 void* dmiConfirmFunc(void* commandBlock)
