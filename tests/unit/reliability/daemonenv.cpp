@@ -87,6 +87,11 @@ void RegisteredDaemon::abandon()
 {
     running = false;
     SLCleanup();
+    // SLCleanup freed the catalogue and the registration handle with every
+    // other SL block; forget them so that nothing frees them again.
+    componentList = nullptr;
+    myHandle = nullptr;
+    registered = 0;
     dmisp::shutdown();
     moxSetLogHook(nullptr);
     moxSetSleepHook(nullptr);
