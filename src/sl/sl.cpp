@@ -8,6 +8,7 @@
 #include <sched.h>
 
 #include "base/sleep.h"
+#include "base/threadcheck.h"
 #include "sl/slevent.h"
 #include "sl/slhandle.h"
 #include "sl/slstring.h"
@@ -283,6 +284,7 @@ int synchronousExecute(SLHandle* h)
     if (!completesAtOnce(code)) {
         while (pendingWord(h).load() == 1 && cleanup.load() == 0)
             sched_yield();
+        MOX_RECEIVE(h); // the provider's confirm precedes the pending word
         if (pendingWord(h).load() == 1)
             word(h, 11, statusAbandoned);
     }
@@ -304,8 +306,10 @@ int SLSynchronousExecute(SLHandle* h)
 void* dmiConfirmFunc(void* commandBlock)
 {
     // The command block is the start of its handle.
-    if (commandBlock != nullptr)
+    if (commandBlock != nullptr) {
+        MOX_PUBLISH(commandBlock);
         pendingWord(static_cast<SLHandle*>(commandBlock)).store(0);
+    }
     return commandBlock;
 }
 

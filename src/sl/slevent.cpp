@@ -6,6 +6,7 @@
 #include <pthread.h>
 #include <sched.h>
 
+#include "base/threadcheck.h"
 #include "sl/slhandle.h"
 
 namespace {
@@ -76,6 +77,7 @@ void SLEventSetHandler(SLIndicationHandler handler)
         timespec poll{0, handlerPollNs};
         nanosleep(&poll, nullptr);
     }
+    MOX_RECEIVE(&slEventThreads); // everything the finished threads did
 }
 
 void SLIndicationFunc(void* indication)
@@ -113,6 +115,7 @@ void* SLEventThread(void* handle)
     if (complete != nullptr)
         complete(indication);
     SLDestroyHandle(h);
+    MOX_PUBLISH(&slEventThreads);
     slEventThreads.fetch_sub(1);
     return nullptr;
 }
