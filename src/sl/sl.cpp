@@ -224,6 +224,8 @@ int SLInitialize(void)
 
 int SLCleanup(void)
 {
+    // An indication the provider is still delivering finishes first.
+    slEventQuiesce();
     cleanup = 1;
     // A command still in progress ends its wait on the flag; let it, and every
     // command queued behind it on the mutex, leave before their handles are

@@ -13,6 +13,7 @@ namespace {
 
 std::atomic<SLIndicationHandler> userHandler{nullptr};
 std::atomic<int> slEventThreads{0}; // started and not yet finished
+std::atomic<int> callsInside{0};     // calls of SLIndicationFunc under way
 
 // The indication header: 13 words, copied into the command block.
 constexpr uint32_t headerWords = 13;
@@ -67,6 +68,14 @@ void SLEventCleanup(void)
     userHandler = nullptr;
 }
 
+void slEventQuiesce(void)
+{
+    userHandler = nullptr;
+    while (callsInside.load() != 0)
+        sched_yield();
+    MOX_RECEIVE(&callsInside);
+}
+
 void SLEventSetHandler(SLIndicationHandler handler)
 {
     userHandler = handler;
@@ -84,23 +93,29 @@ void SLIndicationFunc(void* indication)
 {
     if (indication == nullptr)
         return;
+    ++callsInside;
     uint32_t length = loadWordAt(indication, 2);
     // A length that cannot hold the header, or is absurd, is not copied: the
-    // indication is completed and dropped.
+    // indication is completed and dropped. Without a handler no handle is
+    // made, so that a call racing SLCleanup touches no SL memory.
     bool sane = length >= headerBytes && length <= maxIndicationSize;
-    SLHandle* h = sane ? SLCreateHandle(length) : nullptr;
+    SLHandle* h = sane && userHandler.load() != nullptr ? SLCreateHandle(length) : nullptr;
     if (h != nullptr && userHandler.load() != nullptr) {
         std::memcpy(h->command, indication, headerBytes);
         storeWordAt(h->command, 13, 0);
         storeWordAt(h->command, 14, 0);
         storeWordAt(h->command, 15, pointerWord(indication));
         std::memcpy(h->confirm, indication, length);
-        if (startEventThread(h))
+        if (startEventThread(h)) {
+            --callsInside;
             return; // now in the event thread's care
+        }
     }
     if (Completion complete = completionOf(indication))
         complete(indication);
     SLDestroyHandle(h);
+    MOX_PUBLISH(&callsInside);
+    --callsInside;
 }
 
 void* SLEventThread(void* handle)

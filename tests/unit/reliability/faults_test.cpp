@@ -13,8 +13,10 @@
 #include <sys/mount.h>
 #include <sys/stat.h>
 #include <thread>
+#include <vector>
 #include <unistd.h>
 
+#include "base/bytes.h"
 #include "base/sleep.h"
 #include "daemon/events.h"
 #include "daemonenv.h"
@@ -24,6 +26,7 @@
 #include "obx/obxapi.h"
 #include "sl/sl.h"
 #include "sl/slaccess.h"
+#include "sl/slevent.h"
 #include "sl/slhandle.h"
 #include "sl/slstring.h"
 #include "testmifs.h"
@@ -249,6 +252,47 @@ TEST(ProviderFaults, FullDiskLeavesTheDatabaseConsistent)
     dmisp::shutdown();
     umount2(dir.c_str(), MNT_DETACH);
     rmdir(dir.c_str());
+}
+
+// The provider delivers an indication while the application cleans up (its
+// indication thread calls back after the unregister was confirmed). Cleanup
+// waits for the call to leave, and the call, finding no handler, touches no
+// SL memory: before, cleanup freed the handle the call had made and the call
+// then freed it again.
+std::atomic<int> deliveryInside{0};
+std::atomic<bool> deliveryRelease{false};
+
+void slowCompletion(void*)
+{
+    deliveryInside = 1;
+    while (!deliveryRelease)
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+}
+
+TEST(SLCleanupFaults, CleanupWaitsForAnIndicationBeingDelivered)
+{
+    SLInitialize();
+    std::vector<uint32_t> indication(13, 0);
+    indication[0] = SL_LEVEL_CHECK;
+    indication[1] = 1;
+    indication[2] = 52;
+    indication[11] = pointerWord(reinterpret_cast<void*>(&slowCompletion));
+    unsigned strings = slLiveStringCount();
+    std::thread provider([&] { SLIndicationFunc(indication.data()); });
+    while (deliveryInside == 0)
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    EXPECT_EQ(slLiveStringCount(), strings) << "no handle made without a handler";
+    std::atomic<bool> cleaned{false};
+    std::thread cleanup([&] {
+        SLCleanup();
+        cleaned = true;
+    });
+    std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    EXPECT_FALSE(cleaned.load()) << "cleanup returned while the provider was inside the callback";
+    deliveryRelease = true;
+    provider.join();
+    cleanup.join();
+    EXPECT_TRUE(cleaned.load());
 }
 
 } // namespace
