@@ -11,9 +11,11 @@ set -euo pipefail
 # only installed, never started.
 # python3, util-linux (unshare, nsenter), mount, bsdutils (logger) and
 # iproute2: the end-to-end testbed.
+# clang-14 and libclang-rt-14-dev: the fuzz targets (libFuzzer, i386 runtime).
 packages=(cmake g++ g++-multilib lib32asan8 lib32ubsan1 googletest file python3-aiosmtpd postfix
           binutils man-db groff-base bsdextrautils systemd
-          python3 util-linux mount bsdutils iproute2)
+          python3 util-linux mount bsdutils iproute2
+          clang-14 libclang-rt-14-dev)
 
 missing=()
 for p in "${packages[@]}"; do

@@ -571,6 +571,10 @@ private:
                     return false;
                 haveId = true;
             } else if (wordIs(key, "type")) {
+                // A second type would leave the first one's enumeration
+                // behind, and the written text would no longer parse.
+                if (ra->hasType)
+                    return fail(key.line, "attribute type given twice");
                 if (!advance() || !expectPunct("=") || !type(ra))
                     return false;
                 ra->hasType = true;

@@ -6,6 +6,7 @@
 #include <pthread.h>
 
 #include "actions/actions.h"
+#include "base/threadcheck.h"
 #include "actions/strcase.h"
 #include "events/eventrecord.h"
 #include "events/oldevent.h"
@@ -102,6 +103,7 @@ void* eventHandlerThread(void*)
         SLDestroyHandle(handle);
     }
     --workersInLoop;
+    MOX_PUBLISH(&threadId); // the worker's last writes precede the flag
     threadId = 0;
     return nullptr;
 }
@@ -175,6 +177,7 @@ void KillEventThread(void)
     eventThreadRunning = 0;
     while (threadId == 1)
         sleepOneSecond();
+    MOX_RECEIVE(&threadId);
 }
 
 int DestroyEventHandler(void)

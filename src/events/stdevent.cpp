@@ -24,7 +24,7 @@ uint32_t readEventRow(SLHandle* indication, SLHandle* lookup, EventRecord* recor
     uint32_t component = record->componentId;
     uint32_t group = record->eventGroupId;
     uint32_t instanceData = 0;
-    uint32_t count = SLRowAttributeCount(indication);
+    uint32_t count = slRowAttributesPresent(indication);
     for (uint32_t i = 0; i < count; ++i) {
         uint32_t id = SLRowAttributeId(indication, i);
         uint32_t value = SLRowUnsignedValue(indication, i);
@@ -101,7 +101,7 @@ int modifyKey(SLKeyList* keys, uint32_t mifId, uint32_t eventGroupId, uint32_t e
 
 void runRowActions(SLHandle* row, SLHandle* indication, EventRecord* record)
 {
-    uint32_t count = SLRowAttributeCount(row);
+    uint32_t count = slRowAttributesPresent(row);
     char* alert = nullptr;
     for (uint32_t i = 0; i < count; ++i) {
         uint32_t id = SLRowAttributeId(row, i);

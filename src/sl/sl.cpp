@@ -8,6 +8,7 @@
 #include <sched.h>
 
 #include "base/sleep.h"
+#include "base/threadcheck.h"
 #include "sl/slevent.h"
 #include "sl/slhandle.h"
 #include "sl/slstring.h"
@@ -21,6 +22,8 @@ pthread_mutex_t Dmi_Mutex1 = PTHREAD_MUTEX_INITIALIZER; // held for the whole of
 std::atomic<uint32_t> iMgmtHandle{0};
 std::atomic<uint32_t> iCmdHandle{0};
 std::atomic<int> cleanup{0};
+// Commands inside SLSynchronousExecute, running or waiting for Dmi_Mutex1.
+std::atomic<int> commandsInside{0};
 
 // Command codes.
 enum : uint32_t {
@@ -221,9 +224,14 @@ int SLInitialize(void)
 
 int SLCleanup(void)
 {
+    // An indication the provider is still delivering finishes first.
+    slEventQuiesce();
     cleanup = 1;
-    // A command still in progress ends its wait on the flag; let it leave
-    // before its handle is freed and the mutex it holds is destroyed.
+    // A command still in progress ends its wait on the flag; let it, and every
+    // command queued behind it on the mutex, leave before their handles are
+    // freed and the mutex is destroyed.
+    while (commandsInside.load() != 0)
+        sched_yield();
     pthread_mutex_lock(&Dmi_Mutex1);
     pthread_mutex_unlock(&Dmi_Mutex1);
     SLHandleCleanup();
@@ -232,7 +240,9 @@ int SLCleanup(void)
     return pthread_mutex_destroy(&Dmi_Mutex1);
 }
 
-int SLSynchronousExecute(SLHandle* h)
+namespace {
+
+int synchronousExecute(SLHandle* h)
 {
     SLInvokeFunction invoke = SLDmiInvoke;
     if (invoke == nullptr || h == nullptr)
@@ -255,6 +265,13 @@ int SLSynchronousExecute(SLHandle* h)
         word(h, 4, iCmdHandle.fetch_add(1));
 
     pthread_mutex_lock(&Dmi_Mutex1);
+    if (cleanup.load() != 0) {
+        // Cleanup has begun: a command that waited for the lock is not sent,
+        // since its confirm could arrive after its handle was freed.
+        word(h, 11, statusAbandoned);
+        pthread_mutex_unlock(&Dmi_Mutex1);
+        return 1;
+    }
     uint32_t result = invoke(h->command);
     if (result == statusBusy) {
         moxSleepMs(busySleepMs);
@@ -269,6 +286,7 @@ int SLSynchronousExecute(SLHandle* h)
     if (!completesAtOnce(code)) {
         while (pendingWord(h).load() == 1 && cleanup.load() == 0)
             sched_yield();
+        MOX_RECEIVE(h); // the provider's confirm precedes the pending word
         if (pendingWord(h).load() == 1)
             word(h, 11, statusAbandoned);
     }
@@ -277,11 +295,23 @@ int SLSynchronousExecute(SLHandle* h)
     return (status == 0 || status == 1) ? 0 : 1;
 }
 
+} // namespace
+
+int SLSynchronousExecute(SLHandle* h)
+{
+    ++commandsInside;
+    int rc = synchronousExecute(h);
+    --commandsInside;
+    return rc;
+}
+
 void* dmiConfirmFunc(void* commandBlock)
 {
     // The command block is the start of its handle.
-    if (commandBlock != nullptr)
+    if (commandBlock != nullptr) {
+        MOX_PUBLISH(commandBlock);
         pendingWord(static_cast<SLHandle*>(commandBlock)).store(0);
+    }
     return commandBlock;
 }
 

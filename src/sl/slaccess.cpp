@@ -147,6 +147,16 @@ uint32_t rowEntryWord(SLHandle* h, uint32_t i, uint32_t field)
 
 } // namespace
 
+uint32_t slRowAttributesPresent(SLHandle* h)
+{
+    int64_t row = rowOffset(h);
+    if (row < 0)
+        return 0;
+    uint64_t fit = (confirmLimit(h) - static_cast<uint64_t>(row) - 16) / 16;
+    uint32_t count = recordWord(h, static_cast<uint64_t>(row), 3);
+    return count < fit ? count : static_cast<uint32_t>(fit);
+}
+
 const uint8_t* slConfirmBytes(SLHandle* h, uint64_t offset, uint64_t length)
 {
     return inConfirm(h, offset, length);

@@ -68,6 +68,10 @@ void SLEventSelectRowCnf(SLHandle* h, uint32_t c, uint32_t r);
 // The row record the row accessors read (the confirm's row, or the selected
 // row of an event indication); null when it lies outside the buffer.
 const uint8_t* pGetRow(SLHandle* h);
+// The row's attribute count cut to the entries that lie inside the buffer:
+// what a loop over the row's entries may run to (a hostile count would
+// otherwise keep it going for billions of absent entries).
+uint32_t slRowAttributesPresent(SLHandle* h);
 // Address of `length` bytes at `offset` of the confirm buffer, or null when
 // they do not lie inside it (for an indication: inside its stated length).
 const uint8_t* slConfirmBytes(SLHandle* h, uint64_t offset, uint64_t length);

@@ -6,12 +6,14 @@
 #include <pthread.h>
 #include <sched.h>
 
+#include "base/threadcheck.h"
 #include "sl/slhandle.h"
 
 namespace {
 
 std::atomic<SLIndicationHandler> userHandler{nullptr};
 std::atomic<int> slEventThreads{0}; // started and not yet finished
+std::atomic<int> callsInside{0};     // calls of SLIndicationFunc under way
 
 // The indication header: 13 words, copied into the command block.
 constexpr uint32_t headerWords = 13;
@@ -66,6 +68,14 @@ void SLEventCleanup(void)
     userHandler = nullptr;
 }
 
+void slEventQuiesce(void)
+{
+    userHandler = nullptr;
+    while (callsInside.load() != 0)
+        sched_yield();
+    MOX_RECEIVE(&callsInside);
+}
+
 void SLEventSetHandler(SLIndicationHandler handler)
 {
     userHandler = handler;
@@ -76,29 +86,36 @@ void SLEventSetHandler(SLIndicationHandler handler)
         timespec poll{0, handlerPollNs};
         nanosleep(&poll, nullptr);
     }
+    MOX_RECEIVE(&slEventThreads); // everything the finished threads did
 }
 
 void SLIndicationFunc(void* indication)
 {
     if (indication == nullptr)
         return;
+    ++callsInside;
     uint32_t length = loadWordAt(indication, 2);
     // A length that cannot hold the header, or is absurd, is not copied: the
-    // indication is completed and dropped.
+    // indication is completed and dropped. Without a handler no handle is
+    // made, so that a call racing SLCleanup touches no SL memory.
     bool sane = length >= headerBytes && length <= maxIndicationSize;
-    SLHandle* h = sane ? SLCreateHandle(length) : nullptr;
+    SLHandle* h = sane && userHandler.load() != nullptr ? SLCreateHandle(length) : nullptr;
     if (h != nullptr && userHandler.load() != nullptr) {
         std::memcpy(h->command, indication, headerBytes);
         storeWordAt(h->command, 13, 0);
         storeWordAt(h->command, 14, 0);
         storeWordAt(h->command, 15, pointerWord(indication));
         std::memcpy(h->confirm, indication, length);
-        if (startEventThread(h))
+        if (startEventThread(h)) {
+            --callsInside;
             return; // now in the event thread's care
+        }
     }
     if (Completion complete = completionOf(indication))
         complete(indication);
     SLDestroyHandle(h);
+    MOX_PUBLISH(&callsInside);
+    --callsInside;
 }
 
 void* SLEventThread(void* handle)
@@ -113,6 +130,7 @@ void* SLEventThread(void* handle)
     if (complete != nullptr)
         complete(indication);
     SLDestroyHandle(h);
+    MOX_PUBLISH(&slEventThreads);
     slEventThreads.fetch_sub(1);
     return nullptr;
 }

@@ -17,4 +17,10 @@ void SLIndicationFunc(void* indication);
 // Runs the handler (if one is still installed) on the handle, completes the
 // indication and frees the handle.
 void* SLEventThread(void* handle);
+// Removes the handler and waits until no call of SLIndicationFunc is under
+// way; later calls find no handler and touch no SL memory. SLCleanup calls it
+// first: a provider may still be delivering an indication when the
+// unregister command has been confirmed. Does not wait for event threads.
+void slEventQuiesce(void);
 }
+

@@ -5,6 +5,7 @@
 #include <new>
 #include <pthread.h>
 
+#include "base/threadcheck.h"
 #include "sl/slstring.h"
 
 namespace {
@@ -31,6 +32,9 @@ void appendLocked(SLHandle* head, SLHandle* node)
     node->prev = tail;
     node->next = tail->next;
     head->prev = node;
+    // Everything written into the node so far is seen by a lock-free reader
+    // that finds it through the head.
+    MOX_PUBLISH(head);
     std::atomic_ref<SLHandle*>(tail->next).store(node, std::memory_order_release);
 }
 
@@ -41,6 +45,7 @@ SLHandleListHead::SLHandleListHead()
 {
     head_->next = head_;
     head_->prev = head_;
+    MOX_ATOMIC_WORD(&head_->next);
     head_->pending = 0;
     head_->confirmSize = SL_MIN_CONFIRM_SIZE;
 }
@@ -49,6 +54,7 @@ void slInitHandleList(SLHandle* head)
 {
     head->next = head;
     head->prev = head;
+    MOX_ATOMIC_WORD(&head->next);
 }
 
 unsigned slHandleListLength(SLHandle* head)
@@ -123,7 +129,10 @@ extern "C" int SLEnqueueHandle(SLHandle* head, SLHandle* h)
 extern "C" SLHandle* SLHeadHandle(SLHandle* head)
 {
     SLHandle* first = loadNext(head);
-    return first == head ? nullptr : first;
+    if (first == head)
+        return nullptr;
+    MOX_RECEIVE(head);
+    return first;
 }
 
 extern "C" int SLDestroyAllHandles(SLHandle* head)

@@ -174,6 +174,12 @@ TEST(DmispMifText, RefusesBadFilesWithLineAndReason)
         {variant("    end group\n    start group", "    start group"), "bad.mif:37: unknown block 'group' in group"},
         {variant("1 = \"On\"", "0 = \"On\""), "bad.mif:10: enumeration value 0 given twice"},
         {"start component name = \"x\" \x01 end component", "bad.mif:1: unexpected character '\\x01'"},
+        // Found by fuzzing: an enumeration followed by a second type was kept,
+        // and the writer then emitted a value the enumeration refuses.
+        {"start component name = \"x\"\n start group name = \"g\" class = \"c\" id = 2\n"
+         " start attribute name = \"a\" id = 1 type = start enum 1 = \"One\" end enum\n"
+         " type = displaystring(8) value = \"\" end attribute end group end component",
+         "bad.mif:4: attribute type given twice"},
     };
     for (const auto& tc : cases) {
         Component c;
