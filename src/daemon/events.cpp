@@ -7,7 +7,7 @@
 
 #include "actions/actions.h"
 #include "base/threadcheck.h"
-#include "actions/strcase.h"
+#include "base/strcase.h"
 #include "events/eventrecord.h"
 #include "events/oldevent.h"
 #include "events/stdevent.h"

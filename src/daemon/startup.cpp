@@ -12,6 +12,8 @@
 #include "base/log.h"
 #include "daemon/daemon.h"
 #include "daemon/events.h"
+#include "hardware/lcd.h"
+#include "hardware/sysctrl.h"
 #include "mif/mif.h"
 #include "sl/sl.h"
 
@@ -89,11 +91,23 @@ int check_for_moxnot(void)
     return checkForMoxNot(defaultMarkerCheck());
 }
 
+namespace {
+
+// Registration ends by finding the baseboard groups, system control first.
+void findBaseboardGroups()
+{
+    SysCtrlInitialize();
+    LcdInitialize();
+}
+
+} // namespace
+
 int init_routine(void)
 {
     MoxOsSpecificInit();
     ProcessCfgOption();
     SLInitialize();
+    RegisterWithSLCalls(RegistrationCalls{EventHandler, findBaseboardGroups});
     int rc = RegisterWithSL();
     if (rc == 0)
         CreateEventHandler();

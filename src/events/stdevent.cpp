@@ -3,7 +3,7 @@
 #include <initializer_list>
 
 #include "actions/actions.h"
-#include "daemon/alert.h"
+#include "events/alert.h"
 #include "mif/mif.h"
 #include "sl/sl.h"
 #include "sl/slaccess.h"

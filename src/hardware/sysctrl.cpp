@@ -3,7 +3,7 @@
 #include <algorithm>
 #include <cstring>
 
-#include "actions/strcase.h"
+#include "base/strcase.h"
 #include "mif/format.h"
 #include "mif/mif.h"
 #include "sl/sl.h"

@@ -7,9 +7,6 @@
 #include <syslog.h>
 
 #include "base/log.h"
-#include "daemon/events.h"
-#include "hardware/lcd.h"
-#include "hardware/sysctrl.h"
 #include "sl/sl.h"
 #include "sl/slaccess.h"
 #include "sl/slhandle.h"
@@ -482,18 +479,27 @@ ComponentInfo* appendToList(ComponentInfo* entry, uint32_t componentId, uint32_t
     return added;
 }
 
+namespace {
+RegistrationCalls registrationCalls{nullptr, nullptr};
+} // namespace
+
+void RegisterWithSLCalls(const RegistrationCalls& calls)
+{
+    registrationCalls = calls;
+}
+
 int RegisterWithSL(void)
 {
     myHandle = SLCreateHandle(0);
     if (myHandle == nullptr)
         return 1;
-    if (SLDmiRegisterMgmt(myHandle, EventHandler) != 0)
+    if (SLDmiRegisterMgmt(myHandle, registrationCalls.indicationHandler) != 0)
         return 2;
     if (findMOXmif(myHandle) != 0)
         return 3;
     findSupportedMifs(myHandle);
-    SysCtrlInitialize();
-    LcdInitialize();
+    if (registrationCalls.findBaseboardGroups != nullptr)
+        registrationCalls.findBaseboardGroups();
     registered = 1;
     return 0;
 }

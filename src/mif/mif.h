@@ -82,6 +82,14 @@ extern int moxNewKeyFormat;
 // The group the carry-over reads from and, once set anew, writes to.
 extern int moxActionTableGroup;
 
+// What registration reaches in the layers above it, set by the daemon before
+// RegisterWithSL: the indication handler it registers, and the search for the
+// baseboard's system-control and display groups that ends a registration.
+struct RegistrationCalls {
+    SLIndicationHandler indicationHandler;
+    void (*findBaseboardGroups)(void);
+};
+void RegisterWithSLCalls(const RegistrationCalls& calls);
 // 0 on success; 1 no SL handle, 2 registration refused, 3 own MIF unavailable.
 int RegisterWithSL(void);
 void UnregisterWithSL(void);

@@ -4,7 +4,7 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "actions/strcase.h"
+#include "base/strcase.h"
 #include "sl/sl.h"
 #include "sl/slaccess.h"
 #include "sl/slhandle.h"

@@ -1,6 +1,6 @@
 #include <gtest/gtest.h>
 
-#include "actions/strcase.h"
+#include "base/strcase.h"
 
 namespace {
 

@@ -14,6 +14,9 @@
 #include "base/log.h"
 #include "dmisp/dmisp.h"
 #include "mif/mif.h"
+#include "daemon/events.h"
+#include "hardware/lcd.h"
+#include "hardware/sysctrl.h"
 #include "sl/sl.h"
 #include "sl/slhandle.h"
 
@@ -85,6 +88,7 @@ protected:
     {
         static bool slReady = (SLInitialize(), true);
         (void)slReady;
+        RegisterWithSLCalls(RegistrationCalls{EventHandler, [] { SysCtrlInitialize(); LcdInitialize(); }});
         char pattern[] = "/tmp/moxmifXXXXXX";
         ASSERT_NE(mkdtemp(pattern), nullptr);
         dir = pattern;

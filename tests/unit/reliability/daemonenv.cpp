@@ -9,6 +9,8 @@
 #include "base/sleep.h"
 #include "daemon/events.h"
 #include "mif/mif.h"
+#include "hardware/lcd.h"
+#include "hardware/sysctrl.h"
 #include "sl/sl.h"
 #include "testmifs.h"
 
@@ -56,6 +58,7 @@ bool RegisteredDaemon::start(std::string* error, bool withWorker)
     setenv("UXDMIPATH", dir.c_str(), 1);
     moxSetLogHook(countLine);
     SLInitialize();
+    RegisterWithSLCalls(RegistrationCalls{EventHandler, [] { SysCtrlInitialize(); LcdInitialize(); }});
     if (int rc = RegisterWithSL(); rc != 0) {
         *error = "RegisterWithSL " + std::to_string(rc);
         return false;

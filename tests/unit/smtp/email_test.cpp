@@ -6,6 +6,9 @@
 
 #include "dmisp/dmisp.h"
 #include "mif/mif.h"
+#include "daemon/events.h"
+#include "hardware/lcd.h"
+#include "hardware/sysctrl.h"
 #include "scripted_server.h"
 #include "sl/sl.h"
 #include "smtp/email.h"
@@ -29,6 +32,7 @@ protected:
         ASSERT_NE(board_, 0u) << error;
         setenv("UXDMIPATH", MOX_SOURCE_DIR "/mifs", 1);
         SLInitialize();
+        RegisterWithSLCalls(RegistrationCalls{EventHandler, [] { SysCtrlInitialize(); LcdInitialize(); }});
         ASSERT_EQ(RegisterWithSL(), 0);
         ASSERT_EQ(BaseboardComponentId(), board_);
         ASSERT_EQ(moxHostName(host_), 0);

@@ -1,4 +1,4 @@
-#include "daemon/alert.h"
+#include "events/alert.h"
 
 int IssueOrRegisterAlert(const char*, EventRecord*, int)
 {

@@ -1,4 +1,4 @@
-#include "actions/strcase.h"
+#include "base/strcase.h"
 
 #include <climits>
 
