@@ -67,6 +67,21 @@ def read_sample(path):
     return mutants
 
 
+def interleave(mutants):
+    """One mutant of each folder in turn, so that a run cut short still
+    samples every folder."""
+    by_folder = collections.OrderedDict()
+    for m in mutants:
+        by_folder.setdefault(m.path.split("/")[1], []).append(m)
+    queues = list(by_folder.values())
+    ordered = []
+    while any(queues):
+        for q in queues:
+            if q:
+                ordered.append(q.pop(0))
+    return ordered
+
+
 def check_sample(tree, mutants):
     ids = set()
     for m in mutants:
@@ -158,16 +173,23 @@ def main():
                         help="unit tests: each program whole (fast), or case by case through CTest")
     parser.add_argument("--jobs", type=int, default=2)
     parser.add_argument("--timeout", type=int, default=300, help="seconds per test")
-    parser.add_argument("--out", default=None, help="write the results as JSON here")
+    parser.add_argument("--out", default=None, help="write the results as JSON here, one mutant at a time")
+    parser.add_argument("--resume", action="store_true", help="skip the mutants already in --out")
     parser.add_argument("--candidates", metavar="FILE", help="list possible mutants of FILE and stop")
     args = parser.parse_args()
     if args.candidates:
         candidates(args.candidates)
         return 0
 
-    mutants = read_sample(args.sample)
+    mutants = interleave(read_sample(args.sample))
     if args.only is not None:
         mutants = [m for m in mutants if m.id in args.only]
+    results = []
+    if args.resume and args.out and os.path.exists(args.out):
+        with open(args.out) as f:
+            results = json.load(f)
+        done = {r["id"] for r in results}
+        mutants = [m for m in mutants if m.id not in done]
     args.scratch = args.scratch or tempfile.mkdtemp(prefix="moxmutants.")
     started = time.monotonic()
     tree, build = prepare(args)
@@ -175,7 +197,6 @@ def main():
     if test(build, args, os.path.join(args.scratch, "baseline.log")) != 0:
         sys.exit("the unmutated tree fails its tests; see %s/baseline.log" % args.scratch)
 
-    results = []
     for m in mutants:
         path = os.path.join(tree, m.path)
         with open(path) as f:
@@ -195,6 +216,9 @@ def main():
         seconds = time.monotonic() - began
         results.append({"id": m.id, "path": m.path, "outcome": outcome, "seconds": round(seconds, 1), "why": m.why})
         print("%-5s %-9s %6.0fs  %s: %s" % (m.id, outcome, seconds, m.path, m.why), flush=True)
+        if args.out:
+            with open(args.out, "w") as f:
+                json.dump(results, f, indent=1)
     # Leave the build matching the tree.
     run(["cmake", "--build", build, "-j%d" % args.jobs], tree, os.path.join(args.scratch, "build.log"), 1800)
 
@@ -217,9 +241,6 @@ def main():
         print("\nsurvivors:")
         for r in survivors:
             print("  %s %s: %s" % (r["id"], r["path"], r["why"]))
-    if args.out:
-        with open(args.out, "w") as f:
-            json.dump(results, f, indent=1)
     return 0
 
 
