@@ -12,6 +12,15 @@ build=${MOX_FUZZ_BUILD:-$here/../build-fuzz}
 targets=("$@")
 [ ${#targets[@]} -gt 0 ] || targets=(indication confirm smtp mif config lockfile)
 
+# Where the kernel cannot run i386 programs and qemu's user-mode emulator
+# stands in (scripts/setup.sh), libFuzzer is not dependable: runs hang at exit
+# and the sanitizer's allocator trips over the emulated address space. The
+# campaign is then skipped (77: CTest's skip code), never passed.
+if grep -qs '^enabled' /proc/sys/fs/binfmt_misc/qemu-i386; then
+  echo "fuzz: i386 programs run under an emulator here; the fuzz campaign needs a kernel that runs them"
+  exit 77
+fi
+
 CC=${CC:-clang-14} CXX=${CXX:-clang++-14} cmake -S "$here" -B "$build" -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
 cmake --build "$build" -j2 >/dev/null
 

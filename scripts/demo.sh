@@ -14,4 +14,4 @@ cmake --build build -j"${JOBS:-2}" --target mox dmisp dmictl kobd obxpreload e2e
 b=$PWD/build
 MOX_BIN=$b/bin/mox MOX_SOURCE_DIR=$PWD MOX_INIT_STUB=$b/bin/e2e_initstub \
   MOX_DMICTL=$b/bin/dmictl MOX_KOBD=$b/bin/kobd MOX_OBX_PRELOAD=$b/lib/libobxpreload.so \
-  exec python3 tests/e2e/demo.py
+  exec python3 scripts/demo.py

@@ -12,7 +12,7 @@ import sys
 import time
 import unittest
 
-sys.path.insert(0, os.path.dirname(os.path.abspath(__file__)))
+sys.path.insert(0, os.path.join(os.path.dirname(os.path.abspath(__file__)), "..", "tests", "e2e"))
 import testbed  # noqa: E402
 
 LEVELS = ["emerg", "alert", "crit", "err", "warning", "notice", "info", "debug"]
