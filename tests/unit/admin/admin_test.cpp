@@ -59,7 +59,8 @@ TEST(Admin, CommandLine)
         {"mox", nullptr}, {"mox", "-v", nullptr}, {"mox", "--version", "--help", nullptr}, {"mox", "version", nullptr}};
     for (auto& args : daemonArgs) {
         int status = 99;
-        EXPECT_FALSE(moxCommandLine(static_cast<int>(args.size()) - 1, const_cast<char**>(args.data()), stdout, &status));
+        int argc = static_cast<int>(args.size()) - 1;
+        EXPECT_FALSE(moxCommandLine(argc, const_cast<char**>(args.data()), stdout, &status));
         EXPECT_EQ(status, 99);
     }
 }
