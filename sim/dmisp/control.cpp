@@ -322,6 +322,13 @@ int runControl(const std::vector<std::string>& words, std::string* out)
         *out += usageText;
         return 0;
     }
+    if (cmd == "invoke") {
+        // A command of another process's provider (not for people: binary).
+        if (words.size() != 2)
+            return usage();
+        *out = invokeForwarded(a.next());
+        return 0;
+    }
     if (cmd == "list") {
         if (a.more())
             return usage();

@@ -177,6 +177,10 @@ bool waitCommandsIdle(unsigned timeoutMs = 5000);
 // code: 0 done, 1 failed, 2 usage error, 3 provider unavailable. Output and
 // error text go to *out.
 int runControl(const std::vector<std::string>& args, std::string* out);
+// Runs a command block (4096 bytes) that another process's provider
+// forwarded, on the database this process holds. The reply: status, count
+// and the block's word 16 as 32-bit words, then the confirm bytes.
+std::string invokeForwarded(const std::string& command);
 // The control socket path in use ("" when not served).
 std::string controlSocketPath();
 // Sends one request to the provider serving `socketPath` and returns its

@@ -52,6 +52,9 @@ struct State {
     std::condition_variable idle; // a queue ran empty
     Database db;
     bool open = false;
+    // Not empty: another process's provider holds the database and this one
+    // forwards its commands to that provider's control socket.
+    std::string forwardSocket;
     bool stopping = false;
     bool serveControl = false;
     std::vector<Registration> registrations;
@@ -161,6 +164,87 @@ Outcome managementCommand(State& s, const Command& c)
     return o;
 }
 
+bool readText(const std::string& path, std::string* text, std::string* error);
+uint32_t installParsed(State& s, Component c, std::string* error);
+bool uninstallLocked(State& s, uint32_t id);
+
+// A database command (listing, attribute, row, component interface) on the
+// database this process holds; `lock` holds s.mu and is released while an
+// installed file is read. An install stores the new id in word 16.
+Outcome databaseCommand(State& s, std::unique_lock<std::mutex>& lock, uint8_t* block)
+{
+    Outcome o;
+    uint32_t code = loadWordAt(block, 1);
+    uint32_t persist = 0;
+    if (loadWordAt(block, 0) != LevelCheck) {
+        o.status = StatusMalformed;
+    } else if (code == 1026) {
+        std::string path, text, error;
+        Component c;
+        if (!installPath(block, &path)) {
+            o.status = StatusMalformed;
+        } else {
+            // Reading and parsing need no lock.
+            lock.unlock();
+            bool parsed = readText(path, &text, &error) && parseMif(text, path, &c, &error);
+            lock.lock();
+            uint32_t id = parsed ? installParsed(s, std::move(c), &error) : 0;
+            if (id == 0) {
+                std::fprintf(stderr, "dmisp: install refused: %s\n", error.c_str());
+                o.status = StatusInstallFailed;
+            } else {
+                // The new component's id comes back in the command's
+                // component word.
+                storeWordAt(block, 16, id);
+                o.count = 1;
+            }
+        }
+    } else if (code == 1027) {
+        o.status = uninstallLocked(s, loadWordAt(block, 16)) ? StatusOk : StatusNotFound;
+    } else {
+        o = executeCommand(s.db, block, &persist);
+    }
+    if (persist != 0 && !s.db.persist(persist))
+        o.status = StatusStorageFailed;
+    return o;
+}
+
+// The reply to a forwarded command: status, count, the command's word 16,
+// then the confirm bytes.
+std::string encodeOutcome(const Outcome& o, uint32_t word16)
+{
+    std::string reply(12, '\0');
+    uint8_t* p = reinterpret_cast<uint8_t*>(reply.data());
+    storeWordAt(p, 0, o.status);
+    storeWordAt(p, 1, o.count);
+    storeWordAt(p, 2, word16);
+    reply.append(reinterpret_cast<const char*>(o.confirm.data()), o.confirm.size());
+    return reply;
+}
+
+// Sends a command to the provider that holds the database and gives its
+// outcome; an install's new id is stored in word 16 of `block`. A provider
+// that does not answer gives status 11.
+Outcome forwardCommand(const std::string& socketPath, uint8_t* block)
+{
+    Outcome o;
+    std::string reply;
+    int code = controlRequest(socketPath, {"invoke", std::string(reinterpret_cast<const char*>(block), CommandSize)},
+                              &reply);
+    if (code != 0 || reply.size() < 12) {
+        std::fprintf(stderr, "dmisp: the provider at %s did not answer a forwarded command\n", socketPath.c_str());
+        o.status = StatusStorageFailed;
+        return o;
+    }
+    const uint8_t* p = reinterpret_cast<const uint8_t*>(reply.data());
+    o.status = loadWordAt(p, 0);
+    o.count = loadWordAt(p, 1);
+    if (loadWordAt(block, 1) == 1026 && o.status == StatusOk)
+        storeWordAt(block, 16, loadWordAt(p, 2));
+    o.confirm.assign(p + 12, p + reply.size());
+    return o;
+}
+
 void* workerThread(void*)
 {
     State& s = st();
@@ -179,15 +263,21 @@ void* workerThread(void*)
         lock.lock();
         Outcome o;
         uint32_t code = loadWordAt(c->copy, 1);
-        uint32_t persist = 0;
-        if (loadWordAt(c->copy, 0) != LevelCheck)
+        if (loadWordAt(c->copy, 0) != LevelCheck) {
             o.status = StatusMalformed;
-        else if (code == 256 || code == 257)
-            o = managementCommand(s, *c);
-        else
+        } else if (code == 256 || code == 257) {
+            o = managementCommand(s, *c); // registrations stay with this process
+        } else if (!s.forwardSocket.empty()) {
+            std::string socketPath = s.forwardSocket;
+            lock.unlock();
+            o = forwardCommand(socketPath, c->copy);
+            lock.lock();
+        } else {
+            uint32_t persist = 0;
             o = executeCommand(s.db, c->copy, &persist);
-        if (persist != 0 && !s.db.persist(persist))
-            o.status = StatusStorageFailed;
+            if (persist != 0 && !s.db.persist(persist))
+                o.status = StatusStorageFailed;
+        }
         if (o.status == StatusOk && code >= 512 && code <= 514 && s.listing512 > 0) {
             --s.listing512;
             o.status = StatusListing;
@@ -259,6 +349,7 @@ void closeLocked()
     s.indications.clear();
     s.registrations.clear();
     s.db.close();
+    s.forwardSocket.clear();
     s.open = false;
     s.stopping = false;
     s.working = s.delivering = false;
@@ -271,17 +362,29 @@ void closeLocked()
     g_open = false;
 }
 
-bool openLocked(const std::string& directory, bool serveControl, std::string* error)
+std::string controlPathFor(const std::string& directory)
+{
+    const char* env = std::getenv("DMISP_SOCKET");
+    return (env != nullptr && *env != '\0') ? env : directory + "/control.sock";
+}
+
+// Opens the database, or with forwardTo set serves this process by
+// forwarding to the provider listening there (the database stays closed).
+bool openLocked(const std::string& directory, bool serveControl, std::string* error,
+                unsigned lockWaitMs = LockWaitMs, const std::string& forwardTo = "")
 {
     State& s = st();
     closeLocked();
     {
         std::lock_guard<std::mutex> lock(s.mu);
-        if (!s.db.open(directory, LockWaitMs, error))
+        if (!forwardTo.empty())
+            s.forwardSocket = forwardTo;
+        else if (!s.db.open(directory, lockWaitMs, error))
             return false;
         s.open = true;
         if (pthread_create(&s.worker, nullptr, workerThread, nullptr) != 0) {
             s.db.close();
+            s.forwardSocket.clear();
             s.open = false;
             if (error != nullptr)
                 *error = "cannot start the provider thread";
@@ -295,6 +398,7 @@ bool openLocked(const std::string& directory, bool serveControl, std::string* er
             s.mu.lock();
             s.stopping = false;
             s.db.close();
+            s.forwardSocket.clear();
             s.open = false;
             if (error != nullptr)
                 *error = "cannot start the indication thread";
@@ -303,9 +407,8 @@ bool openLocked(const std::string& directory, bool serveControl, std::string* er
         s.threads = true;
     }
     g_open = true;
-    if (serveControl) {
-        const char* env = std::getenv("DMISP_SOCKET");
-        std::string path = (env != nullptr && *env != '\0') ? env : directory + "/control.sock";
+    if (serveControl && forwardTo.empty()) {
+        std::string path = controlPathFor(directory);
         std::string controlError;
         if (!startControl(path, &controlError))
             std::fprintf(stderr, "dmisp: control socket %s: %s\n", path.c_str(), controlError.c_str());
@@ -322,12 +425,25 @@ bool ensureOpen()
     if (st().open)
         return true;
     const char* env = std::getenv("DMISP_DB");
+    const std::string directory = (env != nullptr && *env != '\0') ? env : DefaultDatabase;
     std::string error;
-    if (!openLocked((env != nullptr && *env != '\0') ? env : DefaultDatabase, true, &error)) {
-        std::fprintf(stderr, "dmisp: %s\n", error.c_str());
-        return false;
+    // Another process's provider holds the database: when it answers on its
+    // control socket, forward to it; one that is still starting or going away
+    // gets the lock's usual wait first.
+    const std::string control = controlPathFor(directory);
+    auto answers = [&] {
+        std::string out;
+        return controlRequest(control, {"status"}, &out) == 0;
+    };
+    for (unsigned wait : {0u, LockWaitMs}) {
+        if (openLocked(directory, true, &error, wait))
+            return true;
+        if (error.find("locked by another provider") != std::string::npos && answers() &&
+            openLocked(directory, false, &error, 0, control))
+            return true;
     }
-    return true;
+    std::fprintf(stderr, "dmisp: %s\n", error.c_str());
+    return false;
 }
 
 // ---- database operations (under the lock) -----------------------------------------
@@ -449,6 +565,26 @@ bool waitFor(std::condition_variable& cv, std::unique_lock<std::mutex>& lock, un
 } // namespace
 
 // ---- the C++ interface ----------------------------------------------------------------
+
+std::string invokeForwarded(const std::string& command)
+{
+    Outcome o;
+    uint8_t block[CommandSize] = {};
+    State& s = st();
+    std::unique_lock<std::mutex> lock(s.mu);
+    uint32_t code = command.size() >= 8 ? loadWordAt(reinterpret_cast<const uint8_t*>(command.data()), 1) : 0;
+    ++s.received;
+    ++s.receivedByCode[code];
+    if (command.size() != CommandSize || code == 256 || code == 257) {
+        o.status = StatusMalformed; // registrations stay with the forwarding process
+    } else if (!s.open || !s.forwardSocket.empty()) {
+        o.status = StatusStorageFailed; // this process does not hold the database
+    } else {
+        std::memcpy(block, command.data(), CommandSize);
+        o = databaseCommand(s, lock, block);
+    }
+    return encodeOutcome(o, loadWordAt(block, 16));
+}
 
 int reset(const std::string& directory, bool serveControl, std::string* error)
 {
@@ -787,34 +923,12 @@ extern "C" __attribute__((visibility("default"))) uint32_t DmiInvoke(void* comma
     if (code >= 1024 && code <= 1027) {
         // Component-interface commands complete before returning.
         Outcome o;
-        if (loadWordAt(block, 0) != LevelCheck) {
-            o.status = StatusMalformed;
-        } else if (code == 1026) {
-            std::string path, text, error;
-            Component c;
-            if (!installPath(block, &path)) {
-                o.status = StatusMalformed;
-            } else {
-                // Reading and parsing need no lock.
-                lock.unlock();
-                bool parsed = readText(path, &text, &error) && parseMif(text, path, &c, &error);
-                lock.lock();
-                uint32_t id = parsed ? installParsed(s, std::move(c), &error) : 0;
-                if (id == 0) {
-                    std::fprintf(stderr, "dmisp: install refused: %s\n", error.c_str());
-                    o.status = StatusInstallFailed;
-                } else {
-                    // The new component's id comes back in the command's
-                    // component word.
-                    storeWordAt(block, 16, id);
-                    o.count = 1;
-                }
-            }
-        } else if (code == 1027) {
-            o.status = uninstallLocked(s, loadWordAt(block, 16)) ? StatusOk : StatusNotFound;
+        if (!s.forwardSocket.empty()) {
+            std::string socketPath = s.forwardSocket;
+            lock.unlock();
+            o = forwardCommand(socketPath, block);
         } else {
-            uint32_t persist = 0;
-            o = executeCommand(s.db, block, &persist);
+            o = databaseCommand(s, lock, block);
         }
         deliverOutcome(block, o);
         return InvokeAccepted;

@@ -5,6 +5,7 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include "actions/actionlog.h"
 #include "actions/uxaction.h"
 #include "base/log.h"
 #include "events/dmi2kob.h"
@@ -38,7 +39,7 @@ const ActionEntry* handlers = lscActions;
 
 // A system-control action: asks for the capability first, honours the
 // notifications-only setting, and takes the lock once for each call.
-int systemControl(uint32_t capability, uint32_t code, int32_t delay)
+int systemControl(uint32_t capability, uint32_t code, int32_t delay, const EventRecord* record)
 {
     SystemControlInfo info;
     int rc = MoxGetSystemControlInfo(&info);
@@ -46,6 +47,7 @@ int systemControl(uint32_t capability, uint32_t code, int32_t delay)
         return rc;
     if ((info.capabilities & capability) == 0)
         return 0;
+    actionLogSystemControl(code, record, bNotificationOnly != 0);
     if (bNotificationOnly != 0)
         return 0;
     return MoxInitiateSystemControlAction(code, delay);
@@ -302,32 +304,32 @@ int MoxIdLedBlink(SLHandle*, EventRecord*)
     return 0;
 }
 
-int shutdownOS(SLHandle*, EventRecord*)
+int shutdownOS(SLHandle*, EventRecord* record)
 {
-    return systemControl(0x08, 3, 200);
+    return systemControl(0x08, 3, 200, record);
 }
 
-int shutdownAndPowerOff(SLHandle*, EventRecord*)
+int shutdownAndPowerOff(SLHandle*, EventRecord* record)
 {
-    return systemControl(0x40, 7, 40000);
+    return systemControl(0x40, 7, 40000, record);
 }
 
-int shutdownAndresetsystem(SLHandle*, EventRecord*)
+int shutdownAndresetsystem(SLHandle*, EventRecord* record)
 {
-    return systemControl(0x10, 6, 40000);
+    return systemControl(0x10, 6, 40000, record);
 }
 
-int powerOff(SLHandle*, EventRecord*)
+int powerOff(SLHandle*, EventRecord* record)
 {
-    return systemControl(0x01, 2, 200);
+    return systemControl(0x01, 2, 200, record);
 }
 
-int resetSystem(SLHandle*, EventRecord*)
+int resetSystem(SLHandle*, EventRecord* record)
 {
-    return systemControl(0x02, 1, 200);
+    return systemControl(0x02, 1, 200, record);
 }
 
-int issueNMI(SLHandle*, EventRecord*)
+int issueNMI(SLHandle*, EventRecord* record)
 {
-    return systemControl(0x04, 8, 200);
+    return systemControl(0x04, 8, 200, record);
 }

@@ -9,6 +9,7 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include "actions/actionlog.h"
 #include "base/log.h"
 #include "base/sleep.h"
 
@@ -77,6 +78,8 @@ int processCfgFile(const char* path)
             *c = static_cast<char>(tolower(static_cast<unsigned char>(*c)));
         if (strstr(line, "notificationonly") != nullptr)
             bNotificationOnly = strstr(line, "true") != nullptr ? 1 : 0;
+        if (strstr(line, "actionlog") != nullptr)
+            bActionLog = strstr(line, "true") != nullptr ? 1 : 0;
     }
     fclose(file);
     return 1;

@@ -8,10 +8,12 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include "actions/actionlog.h"
 #include "actions/uxaction.h"
 #include "base/log.h"
 #include "daemon/daemon.h"
 #include "daemon/events.h"
+#include "daemon/notify.h"
 #include "hardware/lcd.h"
 #include "hardware/sysctrl.h"
 #include "mif/mif.h"
@@ -88,6 +90,7 @@ int checkForMoxNot(const MarkerCheck& check)
 
 int check_for_moxnot(void)
 {
+    moxNotify("STATUS=Checking marker files");
     return checkForMoxNot(defaultMarkerCheck());
 }
 
@@ -108,9 +111,15 @@ int init_routine(void)
     ProcessCfgOption();
     SLInitialize();
     RegisterWithSLCalls(RegistrationCalls{EventHandler, findBaseboardGroups});
+    moxNotify("STATUS=Registering with the DMI service provider");
     int rc = RegisterWithSL();
-    if (rc == 0)
-        CreateEventHandler();
+    if (rc == 0) {
+        actionLogStartupCheck();
+        if (CreateEventHandler() == 0) {
+            moxNotify("STATUS=Handling events");
+            moxNotify("READY=1");
+        }
+    }
     return rc;
 }
 

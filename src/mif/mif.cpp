@@ -504,6 +504,18 @@ int RegisterWithSL(void)
     return 0;
 }
 
+int catalogueInstalledMifs(SLHandle* h)
+{
+    uint32_t own = SLMapComponentNameToId(moxComponentName);
+    ComponentInfo* entry = own != 0 ? newComponentInfo(own) : nullptr;
+    if (entry == nullptr)
+        return -1;
+    deleteComponentList(componentList);
+    componentList = entry;
+    findSupportedMifs(h);
+    return 0;
+}
+
 void UnregisterWithSL(void)
 {
     deleteComponentList(componentList);

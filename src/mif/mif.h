@@ -93,6 +93,10 @@ void RegisterWithSLCalls(const RegistrationCalls& calls);
 // 0 on success; 1 no SL handle, 2 registration refused, 3 own MIF unavailable.
 int RegisterWithSL(void);
 void UnregisterWithSL(void);
+// Catalogues the installed own MIF and the supported components, installing
+// and migrating nothing (for a process that only reads). 0, or -1 when the
+// own MIF is not installed.
+int catalogueInstalledMifs(SLHandle* h);
 // 0 when the own component exists afterwards and is catalogued, else -1.
 int findMOXmif(SLHandle* h);
 void findSupportedMifs(SLHandle* h);

@@ -5,6 +5,7 @@
 #include <cstring>
 #include <syslog.h>
 
+#include "actions/actionlog.h"
 #include "actions/actions.h"
 #include "base/log.h"
 #include "mif/format.h"
@@ -64,6 +65,26 @@ void releaseConfig(SLHandle* handle)
 
 } // namespace
 
+int emailReadSettings(SLHandle* handle, const char* hostName, EmailConfig* config)
+{
+    uint32_t baseboard = BaseboardComponentId();
+    char value[1024];
+    if (getStringValue(handle, baseboard, emailGroup, 1, nullptr, value, sizeof value) == 0)
+        return 0;
+    copyCut(config->server, EMAIL_SERVER_SIZE, value);
+    char defaultAddress[EMAIL_SENDER_SIZE];
+    moxDefaultAddress(hostName, defaultAddress, sizeof defaultAddress);
+    if (getStringValue(handle, baseboard, emailGroup, 2, nullptr, value, sizeof value) != 0)
+        copyCut(config->sender, EMAIL_SENDER_SIZE, value);
+    else
+        copyCut(config->sender, EMAIL_SENDER_SIZE, defaultAddress);
+    if (getStringValue(handle, baseboard, emailGroup, 3, nullptr, value, sizeof value) != 0)
+        copyCut(config->recipients, EMAIL_RECIPIENTS_SIZE, value);
+    else
+        copyCut(config->recipients, EMAIL_RECIPIENTS_SIZE, defaultAddress);
+    return 1;
+}
+
 int MoxSendEmail(SLHandle*, EventRecord* record)
 {
     pEmailConfig = static_cast<EmailConfig*>(calloc(1, sizeof(EmailConfig)));
@@ -99,23 +120,11 @@ int MoxSendEmail(SLHandle*, EventRecord* record)
         releaseConfig(handle);
         return 0;
     }
-    uint32_t baseboard = BaseboardComponentId();
-    char value[1024];
-    if (getStringValue(handle, baseboard, emailGroup, 1, nullptr, value, sizeof value) == 0) {
+    if (emailReadSettings(handle, hostName, config) == 0) {
+        actionLogNoServer(record);
         releaseConfig(handle); // no server configured: no e-mail
         return 0;
     }
-    copyCut(config->server, EMAIL_SERVER_SIZE, value);
-    char defaultAddress[EMAIL_SENDER_SIZE];
-    moxDefaultAddress(hostName, defaultAddress, sizeof defaultAddress);
-    if (getStringValue(handle, baseboard, emailGroup, 2, nullptr, value, sizeof value) != 0)
-        copyCut(config->sender, EMAIL_SENDER_SIZE, value);
-    else
-        copyCut(config->sender, EMAIL_SENDER_SIZE, defaultAddress);
-    if (getStringValue(handle, baseboard, emailGroup, 3, nullptr, value, sizeof value) != 0)
-        copyCut(config->recipients, EMAIL_RECIPIENTS_SIZE, value);
-    else
-        copyCut(config->recipients, EMAIL_RECIPIENTS_SIZE, defaultAddress);
 
     snprintf(config->subject, EMAIL_SUBJECT_SIZE, "%s:%s", "Zorek Server Management Alert", hostName);
     copyCut(config->body, EMAIL_BODY_SIZE, firstLine);
@@ -131,7 +140,7 @@ int MoxSendEmail(SLHandle*, EventRecord* record)
     } else {
         appendLine(config->body, "Instance:%s\n", nullptr, "Unknown");
     }
-    _MoxSendEmail(config);
+    actionLogSendEmail(config, record);
     releaseConfig(handle);
     return 0;
 }

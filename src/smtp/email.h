@@ -13,3 +13,8 @@ extern EmailConfig* pEmailConfig;
 // for every alert: attribute 1 the server (no server, no e-mail), 2 the
 // sender, 3 the recipients (both default to "admin@" and the host name).
 int MoxSendEmail(SLHandle* indication, EventRecord* record);
+
+// Reads the server, sender and recipients of the baseboard's e-mail settings
+// into the zero-filled slots of `config`, with "admin@" and `hostName` for an
+// absent sender or recipient list. 0 when no server is set, else 1.
+int emailReadSettings(SLHandle* handle, const char* hostName, EmailConfig* config);

@@ -23,6 +23,16 @@ std::atomic<uint16_t> gs_smtpPort{25};
 std::atomic<unsigned> gs_limitMs{8000};
 std::atomic<SmtpWritableHook> gs_writableHook{nullptr};
 
+// The observer of the dialogue running on this thread, if any.
+thread_local SmtpObserver gs_observer = nullptr;
+thread_local void* gs_observerContext = nullptr;
+
+void observe(int step, int errorClass, int value, const char* reply, const char* message)
+{
+    if (gs_observer != nullptr)
+        gs_observer(gs_observerContext, SmtpStep{step, smtpStepName(step), errorClass, value, reply, message});
+}
+
 constexpr size_t COMMAND_SIZE = 1024;
 constexpr size_t REPLY_SIZE = 1024;
 constexpr size_t RECEIVE_SIZE = 1024;
@@ -87,6 +97,7 @@ int fail(Dialogue& d, int errorClass, int step, int value, const char* format)
 {
     snprintf(d.command, sizeof d.command, format, d.server, value);
     LogErrorMessageForMoxSendEmail(errorClass, step, value, d.command);
+    observe(step, errorClass, value, errorClass == 2 ? d.reply : "", d.command);
     fprintf(stderr, "%s\n", d.command);
     fflush(stderr);
     if (d.sock >= 0) {
@@ -154,10 +165,30 @@ int runStage(Dialogue& d, const Stage& s, int waits = 1)
     d.code = smtpReplyCode(d.reply, d.code);
     if (d.code != s.expected)
         return fail(d, 2, s.codeStep, d.code, "The server[%s] returned the following value:[%d]");
+    observe(s.codeStep, 0, d.code, d.reply, nullptr);
     return 1;
 }
 
 } // namespace
+
+const char* smtpStepName(int step)
+{
+    static const char* const names[] = {"connect", "greeting", "HELO", "MAIL FROM", "RCPT TO",
+                                        "DATA", "subject", "message body", "QUIT"};
+    if (step < 1 || step > 26)
+        return "unknown step";
+    return step <= 3 ? names[0] : names[(step - 4) / 3 + 1];
+}
+
+int smtpSendObserved(EmailConfig* config, SmtpObserver observer, void* context)
+{
+    gs_observer = observer;
+    gs_observerContext = context;
+    int result = _MoxSendEmail(config);
+    gs_observer = nullptr;
+    gs_observerContext = nullptr;
+    return result;
+}
 
 void smtpSetPort(uint16_t port)
 {

@@ -48,6 +48,26 @@ struct EmailConfig {
 // The recipient list is not changed.
 int _MoxSendEmail(EmailConfig* config);
 
+// One step of a dialogue as an observer sees it: a stage that passed
+// (errorClass 0, step the stage's last step number) or the step that failed
+// (errorClass, step and value as given to LogErrorMessageForMoxSendEmail).
+struct SmtpStep {
+    int step;
+    const char* name;    // the stage: "greeting", "HELO", "MAIL FROM", ...
+    int errorClass;      // 0 passed; 1 socket call, 2 reply code, 3 no reply
+    int value;           // the reply code, or the failure's value
+    const char* reply;   // the server's reply as read ("" when none)
+    const char* message; // the failure message; null when the stage passed
+};
+using SmtpObserver = void (*)(void* context, const SmtpStep& step);
+
+// _MoxSendEmail with an observer called on the calling thread after every
+// stage that passed and at the failure, if any.
+int smtpSendObserved(EmailConfig* config, SmtpObserver observer, void* context);
+
+// The stage a step number belongs to ("connect" for steps 1 to 3).
+const char* smtpStepName(int step);
+
 // Reads one reply of at most 1023 bytes within the reply limit (8 seconds over
 // the whole reply). Returns the length of the text placed in out (at most
 // size - 1), 0 when no complete line arrived, -1 for invalid arguments.
