@@ -22,6 +22,10 @@ expected_files="\
 /usr/local/ubo/bin/mox
 /usr/local/ubo/bin/mox.cfg.example
 /usr/local/ubo/lib/libdmisp.so
+/usr/share/doc/mox/changelog.gz
+/usr/share/doc/mox/copyright
+/usr/share/lintian/overrides/mox
+/usr/share/man/man8/dmictl.8.gz
 /usr/share/man/man8/mox.8.gz
 /var/dmi/mifs/backup/mox.mif"
 
@@ -65,7 +69,10 @@ check_tree() {
     cmp -s "$root/var/dmi/mifs/backup/mox.mif" "$source/mifs/mox.mif" || fail "mox.mif differs from the source"
     cmp -s "$root/lib/systemd/system/mox.service" "$source/packaging/mox.service" || fail "unit differs"
     cmp -s "$root/usr/local/ubo/bin/mox.cfg.example" "$source/packaging/mox.cfg.example" || fail "sample differs"
-    gzip -dc "$root/usr/share/man/man8/mox.8.gz" | cmp -s - "$source/packaging/mox.8" || fail "manual page differs"
+    local page
+    for page in mox dmictl; do
+        gzip -dc "$root/usr/share/man/man8/$page.8.gz" | cmp -s - "$source/packaging/$page.8" || fail "$page.8 differs"
+    done
 }
 
 # run_disabled ROOT: the installed daemon loads its provider library from
