@@ -74,17 +74,3 @@ check_tree() {
         gzip -dc "$root/usr/share/man/man8/$page.8.gz" | cmp -s - "$source/packaging/$page.8" || fail "$page.8 differs"
     done
 }
-
-# run_disabled ROOT: the installed daemon loads its provider library from
-# ROOT and, with a marker file in its working directory, says it is disabled
-# and exits with status 0 before touching anything else.
-run_disabled() {
-    local root=$1 work out status
-    work=$(mktemp -d)
-    touch "$work/mox.not"
-    status=0
-    out=$(cd "$work" && LD_LIBRARY_PATH=$root/usr/local/ubo/lib timeout 20 "$root/usr/local/ubo/bin/mox" 2>&1) || status=$?
-    [ "$status" -eq 0 ] || fail "disabled daemon exited with $status: $out"
-    [ "$out" = "Mox has been disabled." ] || fail "disabled daemon printed: $out"
-    rm -rf "$work"
-}
