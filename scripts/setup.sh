@@ -12,10 +12,14 @@ set -euo pipefail
 # python3, util-linux (unshare, nsenter), mount, bsdutils (logger) and
 # iproute2: the end-to-end testbed.
 # clang-14 and libclang-rt-14-dev: the fuzz targets (libFuzzer, i386 runtime).
+# libc6:i386, libstdc++6:i386, libgcc-s1:i386 (the i386 architecture added to
+# dpkg): dpkg-shlibdeps computes the package's Depends from the i386
+# packages' own libraries and symbols files. lintian: the package test.
 packages=(cmake g++ g++-multilib lib32asan8 lib32ubsan1 googletest file python3-aiosmtpd postfix
           binutils man-db groff-base bsdextrautils systemd
           python3 util-linux mount bsdutils iproute2
-          clang-14 libclang-rt-14-dev)
+          clang-14 libclang-rt-14-dev
+          libc6:i386 libstdc++6:i386 libgcc-s1:i386 lintian)
 
 missing=()
 for p in "${packages[@]}"; do
@@ -27,6 +31,7 @@ if [ ${#missing[@]} -gt 0 ]; then
     echo "setup: run as root (or install them yourself): ${missing[*]}" >&2
     exit 1
   fi
+  dpkg --print-foreign-architectures | grep -qx i386 || dpkg --add-architecture i386
   apt-get update -qq
   echo "postfix postfix/main_mailer_type select No configuration" | debconf-set-selections
   DEBIAN_FRONTEND=noninteractive apt-get install -y -qq "${missing[@]}" >/dev/null

@@ -1,6 +1,7 @@
 #!/usr/bin/env bash
 # The installed tree, mounted at its fixed paths in a private mount namespace,
-# runs as the systemd unit describes it: systemd-analyze accepts the unit; the
+# runs as the systemd unit describes it: systemd-analyze accepts the unit and
+# rates its exposure at most 5.0; the
 # daemon started with the unit's ExecStart, WorkingDirectory and Environment
 # (no LD_LIBRARY_PATH: the RUNPATH finds the library) is disabled by a marker
 # file in that directory; without one it installs mox.mif from the MIF
@@ -35,10 +36,12 @@ mount -t tmpfs tmpfs /var && mkdir -p /var/dmi /var/lib && ln -s /run /var/run &
 
 verify=$(systemd-analyze verify --man=no "$unit" 2>&1) || fail "systemd-analyze verify failed"
 [ -z "$verify" ] || fail "systemd-analyze verify: $verify"
+systemd-analyze security --offline=true --threshold=50 "$unit" >/dev/null 2>&1 ||
+    fail "exposure above 5.0: $(systemd-analyze security --offline=true "$unit" 2>&1 | tail -1)"
 
 value() { sed -n "s/^$1=//p" "$unit"; }
 exec_start=$(value ExecStart) workdir=$(value WorkingDirectory)
-[ "$(value Type)" = simple ] || fail "Type=$(value Type)"
+[ "$(value Type)" = notify ] || fail "Type=$(value Type)"
 [ "$(value KillSignal)" = SIGTERM ] || fail "KillSignal=$(value KillSignal)"
 [ "$exec_start" = /usr/local/ubo/bin/mox ] || fail "ExecStart=$exec_start"
 [ "$workdir" = /usr/local/ubo/bin ] || fail "WorkingDirectory=$workdir"

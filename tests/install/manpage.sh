@@ -1,25 +1,29 @@
 #!/usr/bin/env bash
-# mox(8) renders without a warning, and what it states about the marker
-# files, the action codes and their run order agrees with the daemon's code.
+# mox(8) and dmictl(8) render without a warning; what mox(8) states about
+# the marker files, the action codes and their run order agrees with the
+# daemon's code, and dmictl(8) describes every command dmictl has.
 #   manpage.sh SOURCE_DIR
 set -uo pipefail
 source=$1
 . "$source/tests/install/common.sh"
 page=$source/packaging/mox.8
 
-warnings=$(LC_ALL=C MANWIDTH=80 man -l --warnings=w "$page" 2>&1 >/dev/null) || fail "man -l failed"
-[ -z "$warnings" ] || fail "man -l warns: $warnings"
+for p in "$page" "$source/packaging/dmictl.8"; do
+    warnings=$(LC_ALL=C MANWIDTH=80 man -l --warnings=w "$p" 2>&1 >/dev/null) || fail "man -l $p failed"
+    [ -z "$warnings" ] || fail "man -l $p warns: $warnings"
+done
 # One long line per paragraph, no hyphenation, plain ASCII: easy to search.
 text=$(LC_ALL=C MANWIDTH=400 MANROFFOPT=-rHY=0 man -l "$page" 2>/dev/null | col -bx) || fail "man -l failed"
 
-for heading in NAME SYNOPSIS DESCRIPTION "MARKER FILES" CONFIGURATION "ACTIONS TABLES" \
-    "E-MAIL SETTINGS" SIGNALS "EXIT STATUS" ENVIRONMENT FILES; do
+for heading in NAME SYNOPSIS DESCRIPTION OPTIONS "MARKER FILES" CONFIGURATION "ACTIONS TABLES" \
+    "E-MAIL SETTINGS" SIGNALS "EXIT STATUS" SYSTEMD ENVIRONMENT FILES; do
     grep -qx "$heading" <<<"$text" || fail "no section $heading"
 done
 for fact in /usr/local/ubo/bin/mox.cfg notificationonly /var/dmi/mifs/backup/mox.mif \
     /var/run/kobLock /dev/kob /dev/obx UXDMIPATH "group 1012" "Group 10" "Group 4" \
     "mox: initialization failed, return code = 0x" "Mox has been disabled." \
-    "mount -t msdos /dev/fd0 /mnt/floppy" SIGTERM SIGINT SIGQUIT SIGPWR SIGHUP; do
+    "mount -t msdos /dev/fd0 /mnt/floppy" SIGTERM SIGINT SIGQUIT SIGPWR SIGHUP \
+    --version --help --test-email actionlog Type=notify READY=1 "journalctl -u mox" "dmictl(8)"; do
     grep -qF -- "$fact" <<<"$text" || fail "does not mention $fact"
 done
 
@@ -48,4 +52,10 @@ table=$(sed -n '/^ *Code  *Action/,/operating-system shutdown replaces/p' <<<"$t
 [ "$table" = "$expected" ] || fail "action table:"$'\n'"$table"$'\n'"daemon:"$'\n'"$expected"
 grep -qE '^ +17 +display string' <<<"$text" || fail "attribute 17 not explained"
 grep -qE '^ +30 +integer: enable flag' <<<"$text" || fail "attribute 30 not explained"
+
+# Every command of dmictl's usage text has its entry in dmictl(8).
+tool=$(LC_ALL=C MANWIDTH=400 man -l "$source/packaging/dmictl.8" 2>/dev/null | col -bx)
+commands=$(grep -oE '^ +"  [a-z0-9-]+' "$source/sim/dmisp/control.cpp" | awk '{ print $2 }')
+[ "$(wc -w <<<"$commands")" -ge 10 ] || fail "could not read dmictl's commands"
+for c in $commands; do grep -qE "^ {7}$c( |$)" <<<"$tool" || fail "dmictl(8) does not describe $c"; done
 finish
