@@ -74,6 +74,13 @@ void slEventQuiesce(void)
     while (callsInside.load() != 0)
         sched_yield();
     MOX_RECEIVE(&callsInside);
+    // Event threads already started still use their handles (and the handler
+    // they read before the handler was removed): they finish first.
+    while (slEventThreads.load() != 0) {
+        timespec poll{0, 1000 * 1000};
+        nanosleep(&poll, nullptr);
+    }
+    MOX_RECEIVE(&slEventThreads);
 }
 
 void SLEventSetHandler(SLIndicationHandler handler)
