@@ -9,6 +9,7 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include "base/files.h"
 #include "base/log.h"
 #include "base/sleep.h"
 
@@ -65,7 +66,9 @@ int GetOSType(void)
 
 int processCfgFile(const char* path)
 {
-    FILE* file = fopen(path, "r");
+    // A FIFO or device in the file's place would block or never end: only a
+    // regular file is read, anything else counts as a file that cannot be opened.
+    FILE* file = moxOpenRegular(path);
     if (file == nullptr)
         return 0;
     // A line longer than the buffer arrives in pieces, each taken as a line.
