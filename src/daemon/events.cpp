@@ -110,7 +110,7 @@ void eventActions(SLHandle* handle)
 {
     if (SLEventClassCount(handle) == 0)
         return;
-    const DmiString* classString = SLEventClassString(handle, 0);
+    const DmiString* classString = SLEventClassStringUnchecked(handle, 0);
     if (classString == nullptr)
         return;
     char prefix[17];

@@ -113,6 +113,8 @@ void SLIndicationFunc(void* indication)
         storeWordAt(h->command, 14, 0);
         storeWordAt(h->command, 15, pointerWord(indication));
         std::memcpy(h->confirm, indication, length);
+        // Whatever reads past the indication's end finds zeros, not old heap.
+        std::memset(h->confirm + length, 0, h->confirmSize - length);
         if (startEventThread(h)) {
             --callsInside;
             return; // now in the event thread's care
