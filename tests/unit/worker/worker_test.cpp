@@ -58,6 +58,7 @@ protected:
     void SetUp() override
     {
         signal(SIGPIPE, SIG_IGN);
+        alarm(120); // a blocking open, read or connect ends the run, not the suite
         char pattern[] = "/tmp/moxworkerXXXXXX";
         dir_ = mkdtemp(pattern);
         lines.clear();
@@ -65,6 +66,7 @@ protected:
     }
     void TearDown() override
     {
+        alarm(0);
         moxSetLogHook(nullptr);
         std::string rm = "rm -rf " + dir_;
         EXPECT_EQ(system(rm.c_str()), 0);
