@@ -42,6 +42,13 @@ bool readPid(const char* lockFile, char (&pid)[20], bool& present)
 // reader came or the path is no FIFO.
 int openFifo(const char* fifo, unsigned waitMs)
 {
+    // Not even opened when it is no FIFO now (opening some devices acts);
+    // checked again on the descriptor, in case the path changed in between.
+    struct stat before;
+    if (stat(fifo, &before) == 0 && !S_ISFIFO(before.st_mode)) {
+        errno = EINVAL;
+        return -1;
+    }
     const unsigned stepMs = 20;
     for (unsigned waited = 0;; waited += stepMs) {
         int fd = open(fifo, O_WRONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC);
