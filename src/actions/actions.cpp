@@ -8,6 +8,7 @@
 #include "actions/actionlog.h"
 #include "actions/uxaction.h"
 #include "base/log.h"
+#include "base/text.h"
 #include "events/dmi2kob.h"
 #include "hardware/lcd.h"
 #include "hardware/sysaction.h"
@@ -98,6 +99,8 @@ void logStandardEvent(SLHandle*, EventRecord* record)
     snprintf(line, sizeof line, "TYPE:%s COMPONENT:%s GROUP:%s SEVERITY:%s ROW:%s SYSTEM:%s SUBSYSTEM:%s",
              text(record->eventTypeText), text(record->componentName), text(record->groupName),
              text(record->severityText), label, text(record->systemText), text(record->subsystemText));
+    // Every text in the line comes from the provider; the line end is ours.
+    moxBlankControls(line);
     moxLog(severityPriority(record->severity), "%s\n", line);
 }
 
@@ -132,6 +135,7 @@ void logBaseboardEvent(SLHandle* indication, EventRecord* record)
     snprintf(line, sizeof line, "NAME:%s COMPONENT:%s GROUP:%s ROW:%s ATTRIBUTE:%s %s", name, text(componentName),
              text(GroupName(handle, component, record->groupId)), label,
              text(AttributeName(handle, component, record->groupId, record->attributeId)), value);
+    moxBlankControls(line);
     moxLog(priority, "%s\n", line);
     SLDeleteString(componentName);
     SLDestroyHandle(handle);
@@ -145,6 +149,7 @@ void logUnknownEvent(SLHandle*, EventRecord* record)
     char* name = listedComponentName(handle, record->componentId);
     char line[124];
     snprintf(line, sizeof line, "DMI Unknown Indication %s", text(name));
+    moxBlankControls(line);
     moxLog(LOG_NOTICE, "%s\n", line);
     SLDeleteString(name);
     SLDestroyHandle(handle);
@@ -228,6 +233,7 @@ int ConsoleMessage(SLHandle*, EventRecord* record)
 {
     char* message = createEventMessage(record);
     if (message != nullptr) {
+        moxBlankControls(message);
         fprintf(stderr, "MOX: %s\n", message);
         SLDeleteString(message);
     }
@@ -269,6 +275,8 @@ int BroadcastMessage(SLHandle*, EventRecord* record)
     if (SLListGroup(handle, record->componentId, record->groupId) == 0)
         name = NewCString(SLGroupName(handle, 0));
     if (name != nullptr) {
+        // The name is cleaned, not the message: its line end is the daemon's.
+        moxBlankControls(name);
         char message[1024];
         snprintf(message, sizeof message, "Please check group %s on this machine\n", name);
         moxLog(LOG_EMERG, "%s\n", message);
@@ -282,6 +290,7 @@ int writeToLCD(SLHandle*, EventRecord* record)
 {
     char message[1024];
     snprintf(message, sizeof message, "Check: %s", text(record->groupName));
+    moxBlankControls(message);
     WriteLCD(message);
     return 0;
 }

@@ -10,6 +10,7 @@
 #include <unistd.h>
 
 #include "actions/actionlog.h"
+#include "base/files.h"
 #include "base/log.h"
 #include "base/sleep.h"
 
@@ -66,7 +67,9 @@ int GetOSType(void)
 
 int processCfgFile(const char* path)
 {
-    FILE* file = fopen(path, "r");
+    // A FIFO or device in the file's place would block or never end: only a
+    // regular file is read, anything else counts as a file that cannot be opened.
+    FILE* file = moxOpenRegular(path);
     if (file == nullptr)
         return 0;
     // A line longer than the buffer arrives in pieces, each taken as a line.

@@ -56,16 +56,51 @@ void sleepOneSecond()
     nanosleep(&second, nullptr);
 }
 
-// The class string's first 16 characters, read whatever its length word says
-// (the class test is a prefix test), but never past the end of the indication.
+// Wakes the idle worker when an indication is queued (or it is told to stop);
+// without a wake-up it still looks at the queue once a second.
+pthread_mutex_t wakeMutex = PTHREAD_MUTEX_INITIALIZER;
+pthread_cond_t wakeCondition;
+unsigned wakeUps = 0; // under wakeMutex
+
+void initWake()
+{
+    pthread_condattr_t attributes;
+    pthread_condattr_init(&attributes);
+    pthread_condattr_setclock(&attributes, CLOCK_MONOTONIC);
+    pthread_cond_init(&wakeCondition, &attributes);
+    pthread_condattr_destroy(&attributes);
+}
+
+void wakeWorker()
+{
+    pthread_mutex_lock(&wakeMutex);
+    ++wakeUps;
+    pthread_cond_signal(&wakeCondition);
+    pthread_mutex_unlock(&wakeMutex);
+}
+
+// Waits at most a second unless a wake-up came since the last wait.
+void waitForWork()
+{
+    pthread_mutex_lock(&wakeMutex);
+    if (wakeUps == 0) {
+        timespec until{};
+        clock_gettime(CLOCK_MONOTONIC, &until);
+        until.tv_sec += 1;
+        pthread_cond_timedwait(&wakeCondition, &wakeMutex, &until);
+    }
+    wakeUps = 0;
+    pthread_mutex_unlock(&wakeMutex);
+}
+
+// The class string's first 16 characters, read whatever the string's length
+// word says (the class test is a prefix test), but never past the end of the
+// indication's buffer.
 void classPrefix(SLHandle* handle, const DmiString* classString, char (&prefix)[17])
 {
     std::memset(prefix, 0, sizeof prefix);
     const char* text = dmiStringText(classString);
     uint32_t limit = handle->confirmSize;
-    uint32_t stated = loadWordAt(handle->command, 2);
-    if (SLIndicationType(handle) < 256 && stated < limit)
-        limit = stated;
     const char* end = reinterpret_cast<const char*>(handle->confirm) + limit;
     size_t available = text < end ? static_cast<size_t>(end - text) : 0;
     std::memcpy(prefix, text, available < 16 ? available : 16);
@@ -75,7 +110,7 @@ void eventActions(SLHandle* handle)
 {
     if (SLEventClassCount(handle) == 0)
         return;
-    const DmiString* classString = SLEventClassString(handle, 0);
+    const DmiString* classString = SLEventClassStringUnchecked(handle, 0);
     if (classString == nullptr)
         return;
     char prefix[17];
@@ -96,7 +131,7 @@ void* eventHandlerThread(void*)
     while (eventThreadRunning == 1) {
         SLHandle* handle = SLHeadHandle(slHandleList.get());
         if (handle == nullptr) {
-            sleepOneSecond();
+            waitForWork();
             continue;
         }
         processEvent(handle);
@@ -150,12 +185,15 @@ int EventHandler(SLHandle* handle)
         return 0;
     SLUnlinkHandle(copy);
     SLEnqueueHandle(slHandleList.get(), copy);
+    wakeWorker();
     return 0;
 }
 
 int CreateEventHandler(void)
 {
     slInitHandleList(slHandleList.get());
+    static pthread_once_t wakeOnce = PTHREAD_ONCE_INIT;
+    pthread_once(&wakeOnce, initWake);
     eventThreadRunning = 1;
     // Counted as running from here, not from its first step: a KillEventThread
     // that comes before the thread has started must still wait for it, or a
@@ -175,6 +213,8 @@ int CreateEventHandler(void)
 void KillEventThread(void)
 {
     eventThreadRunning = 0;
+    if (threadId == 1)
+        wakeWorker();
     while (threadId == 1)
         sleepOneSecond();
     MOX_RECEIVE(&threadId);

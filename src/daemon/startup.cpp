@@ -1,5 +1,6 @@
 #include "daemon/startup.h"
 
+#include <cerrno>
 #include <csignal>
 #include <cstdlib>
 #include <cstring>
@@ -10,6 +11,7 @@
 
 #include "actions/actionlog.h"
 #include "actions/uxaction.h"
+#include "base/files.h"
 #include "base/log.h"
 #include "daemon/daemon.h"
 #include "daemon/events.h"
@@ -29,24 +31,6 @@ void tell(const MarkerCheck& check, const char* text, const char* logText = null
     moxLog(LOG_ERR, "%s", logText != nullptr ? logText : text);
 }
 
-bool readable(const char* path)
-{
-    int fd = open(path, O_RDONLY);
-    if (fd < 0)
-        return false;
-    close(fd);
-    return true;
-}
-
-bool fopenable(const char* path)
-{
-    FILE* file = fopen(path, "r");
-    if (file == nullptr)
-        return false;
-    fclose(file);
-    return true;
-}
-
 } // namespace
 
 MarkerCheck defaultMarkerCheck()
@@ -64,7 +48,7 @@ MarkerCheck defaultMarkerCheck()
 int checkForMoxNot(const MarkerCheck& check)
 {
     // In the working directory vornmox.not comes first; on the floppy mox.not.
-    if (readable(check.localVornmox) || readable(check.localMox))
+    if (moxCanOpen(check.localVornmox) || moxCanOpen(check.localMox))
         return 4;
     tell(check, "Checking for mox configurations ..\n", "\nChecking for mox configurations ..\n");
     if (check.run(check.mountCommand) != 0) {
@@ -72,12 +56,12 @@ int checkForMoxNot(const MarkerCheck& check)
         tell(check, "Proceeding with loading mox ..\n");
         return 0;
     }
-    if (fopenable(check.floppyMox)) {
+    if (moxCanOpen(check.floppyMox)) {
         check.run(check.umountCommand);
         tell(check, "file mox.not  found in floppy\n");
         return 4;
     }
-    if (fopenable(check.floppyVornmox)) {
+    if (moxCanOpen(check.floppyVornmox)) {
         check.run(check.umountCommand);
         tell(check, "file vornmox.not found in floppy\n");
         return 4;
@@ -125,6 +109,9 @@ int init_routine(void)
 
 int unload(void)
 {
+    // The worker may be waiting for a confirm that will not come; it must
+    // leave that wait before it can be told to stop.
+    SLAbandonCommands();
     DestroyEventHandler();
     return SLCleanup();
 }
@@ -158,8 +145,31 @@ void* mainThread(void*)
     return nullptr;
 }
 
+int openStandardDescriptors()
+{
+    int opened = 0;
+    for (int fd = 0; fd <= 2; ++fd) {
+        if (fcntl(fd, F_GETFD) != -1 || errno != EBADF)
+            continue;
+        int null = open("/dev/null", O_RDWR);
+        if (null < 0)
+            return -1;
+        // The lower descriptors are open, so the new one is normally fd.
+        if (null != fd) {
+            dup2(null, fd);
+            close(null);
+        }
+        ++opened;
+    }
+    return opened;
+}
+
 void moxMain()
 {
+    // Before anything can open a descriptor: a closed standard descriptor
+    // would otherwise be taken by the log socket or a file, and start-up text
+    // and the bell would go there.
+    openStandardDescriptors();
     // Lines reach a supervisor that captures standard output as they are written.
     setvbuf(stdout, nullptr, _IOLBF, 0);
     if (check_for_moxnot() == 4) {

@@ -11,6 +11,9 @@ void* mainThread(void* unused);
 // 0, or the non-zero result of RegisterWithSL.
 int init_routine(void);
 int unload(void);
+// Opens /dev/null on each of descriptors 0, 1 and 2 that is closed: the number
+// opened, or -1 when /dev/null cannot be opened.
+int openStandardDescriptors();
 
 // Where the marker check looks and how it runs the floppy commands.
 struct MarkerCheck {

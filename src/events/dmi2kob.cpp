@@ -6,8 +6,10 @@
 #include <ctime>
 #include <fcntl.h>
 #include <syslog.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
+#include "base/files.h"
 #include "base/log.h"
 
 namespace {
@@ -15,7 +17,9 @@ namespace {
 // The lock file's first word, when it is a decimal process id.
 bool readPid(const char* lockFile, char (&pid)[20], bool& present)
 {
-    FILE* lock = fopen(lockFile, "r");
+    // Only a regular lock file is read; anything else in its place (a FIFO
+    // would block the worker) is left alone, like a lock that cannot be opened.
+    FILE* lock = moxOpenRegular(lockFile);
     present = lock != nullptr;
     if (lock == nullptr)
         return false;
@@ -32,15 +36,29 @@ bool readPid(const char* lockFile, char (&pid)[20], bool& present)
 
 // Opens the FIFO for writing once its reader has it open, waiting at most
 // `waitMs`: a peer that holds the lock but never reads must not stall the
-// event worker. -1 (errno set) when no reader came.
+// event worker. The descriptor stays non-blocking, so that a full pipe fails
+// the write instead of holding the worker. Anything but a FIFO (an ordinary
+// file behind a link, a device) is closed unwritten. -1 (errno set) when no
+// reader came or the path is no FIFO.
 int openFifo(const char* fifo, unsigned waitMs)
 {
+    // Not even opened when it is no FIFO now (opening some devices acts);
+    // checked again on the descriptor, in case the path changed in between.
+    struct stat before;
+    if (stat(fifo, &before) == 0 && !S_ISFIFO(before.st_mode)) {
+        errno = EINVAL;
+        return -1;
+    }
     const unsigned stepMs = 20;
     for (unsigned waited = 0;; waited += stepMs) {
-        int fd = open(fifo, O_WRONLY | O_NONBLOCK);
+        int fd = open(fifo, O_WRONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC);
         if (fd >= 0) {
-            int flags = fcntl(fd, F_GETFL);
-            fcntl(fd, F_SETFL, flags & ~O_NONBLOCK);
+            struct stat status;
+            if (fstat(fd, &status) != 0 || !S_ISFIFO(status.st_mode)) {
+                close(fd);
+                errno = EINVAL;
+                return -1;
+            }
             return fd;
         }
         if (errno != ENXIO || waited >= waitMs)
@@ -115,8 +133,10 @@ int kobProcessAlarmAt(const KobPaths& paths, EventRecord* record)
         perror("Error opening /dev/kob");
         return 0;
     }
+    // The record is below PIPE_BUF: it goes in whole or, with the pipe full,
+    // not at all (EAGAIN).
     ssize_t written = write(fd, &alarm, sizeof alarm);
-    if (written <= 0) {
+    if (written != static_cast<ssize_t>(sizeof alarm)) {
         moxLog(LOG_INFO, "Error writing to pipe at file descriptor %i\n", fd);
         close(fd);
         return 0;

@@ -222,6 +222,11 @@ int SLInitialize(void)
     return rc;
 }
 
+void SLAbandonCommands(void)
+{
+    cleanup = 1;
+}
+
 int SLCleanup(void)
 {
     // An indication the provider is still delivering finishes first.

@@ -23,6 +23,9 @@ extern SLInvokeFunction SLDmiInvoke;
 
 int SLInitialize(void);
 int SLCleanup(void);
+// Ends the confirm wait of a command in progress (it fails) and makes every
+// later command fail unsent, as SLCleanup does first; SLInitialize undoes it.
+void SLAbandonCommands(void);
 int SLSynchronousExecute(SLHandle* h);
 // The confirm callback given to the provider: clears the pending word of the
 // handle whose command block it receives; returns its argument.

@@ -300,6 +300,13 @@ DmiString* SLRowStringPtr(SLHandle* h, uint32_t i)
 uint32_t SLEventClassCount(SLHandle* h) { return recordWord(h, eventData(h), 0); }
 uint32_t SLEventComponentId(SLHandle* h, uint32_t c) { return classWord(h, c, 0); }
 DmiString* SLEventClassString(SLHandle* h, uint32_t c) { return stringAt(h, classWord(h, c, 1)); }
+
+DmiString* SLEventClassStringUnchecked(SLHandle* h, uint32_t c)
+{
+    uint32_t offset = classWord(h, c, 1);
+    const uint8_t* at = offset != 0 ? inConfirm(h, offset, 4) : nullptr;
+    return reinterpret_cast<DmiString*>(const_cast<uint8_t*>(at));
+}
 uint32_t SLEventRowCount(SLHandle* h, uint32_t c) { return classWord(h, c, 2); }
 
 void SLEventSelectRowCnf(SLHandle* h, uint32_t c, uint32_t r)

@@ -61,6 +61,9 @@ DmiString* SLRowStringPtr(SLHandle* h, uint32_t i);
 uint32_t SLEventClassCount(SLHandle* h);
 uint32_t SLEventComponentId(SLHandle* h, uint32_t c);
 DmiString* SLEventClassString(SLHandle* h, uint32_t c);
+// Class c's string when its count word lies inside the indication, whatever
+// the count says (the class test reads only a prefix); null otherwise.
+DmiString* SLEventClassStringUnchecked(SLHandle* h, uint32_t c);
 uint32_t SLEventRowCount(SLHandle* h, uint32_t c);
 void SLEventSelectRowCnf(SLHandle* h, uint32_t c, uint32_t r);
 }

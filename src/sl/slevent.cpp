@@ -74,6 +74,13 @@ void slEventQuiesce(void)
     while (callsInside.load() != 0)
         sched_yield();
     MOX_RECEIVE(&callsInside);
+    // Event threads already started still use their handles (and the handler
+    // they read before the handler was removed): they finish first.
+    while (slEventThreads.load() != 0) {
+        timespec poll{0, 1000 * 1000};
+        nanosleep(&poll, nullptr);
+    }
+    MOX_RECEIVE(&slEventThreads);
 }
 
 void SLEventSetHandler(SLIndicationHandler handler)
@@ -106,6 +113,8 @@ void SLIndicationFunc(void* indication)
         storeWordAt(h->command, 14, 0);
         storeWordAt(h->command, 15, pointerWord(indication));
         std::memcpy(h->confirm, indication, length);
+        // Whatever reads past the indication's end finds zeros, not old heap.
+        std::memset(h->confirm + length, 0, h->confirmSize - length);
         if (startEventThread(h)) {
             --callsInside;
             return; // now in the event thread's care

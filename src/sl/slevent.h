@@ -18,9 +18,10 @@ void SLIndicationFunc(void* indication);
 // indication and frees the handle.
 void* SLEventThread(void* handle);
 // Removes the handler and waits until no call of SLIndicationFunc is under
-// way; later calls find no handler and touch no SL memory. SLCleanup calls it
-// first: a provider may still be delivering an indication when the
-// unregister command has been confirmed. Does not wait for event threads.
+// way and every event thread started has finished; later calls find no
+// handler and touch no SL memory. SLCleanup calls it first: a provider may
+// still be delivering an indication when the unregister command has been
+// confirmed, and an event thread frees its handle when it ends.
 void slEventQuiesce(void);
 }
 

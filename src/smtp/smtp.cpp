@@ -7,6 +7,7 @@
 #include <cstdio>
 #include <cstring>
 #include <ctime>
+#include <fcntl.h>
 #include <netdb.h>
 #include <netinet/in.h>
 #include <poll.h>
@@ -75,6 +76,43 @@ bool waitWritable(int sock, int timeoutMs)
             continue;
         return r > 0;
     }
+}
+
+// Connects within timeoutMs: a server that never completes the handshake (its
+// accept queue full, a black hole) must not hold the event worker, whose
+// system-control actions still wait. 0, or the error number (ETIMEDOUT when
+// the time ran out). The socket is blocking again afterwards.
+int connectWithin(int sock, const sockaddr_in& address, int timeoutMs)
+{
+    int flags = fcntl(sock, F_GETFL);
+    if (flags < 0 || fcntl(sock, F_SETFL, flags | O_NONBLOCK) != 0)
+        return errno;
+    int error = 0;
+    if (connect(sock, reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) {
+        error = errno;
+        if (error == EINPROGRESS || error == EINTR) {
+            const int64_t deadline = nowMs() + timeoutMs;
+            for (;;) {
+                pollfd p{sock, POLLOUT, 0};
+                int r = poll(&p, 1, msLeft(deadline));
+                if (r < 0 && errno == EINTR)
+                    continue;
+                if (r < 0) {
+                    error = errno;
+                } else if (r == 0) {
+                    error = ETIMEDOUT;
+                } else {
+                    socklen_t length = sizeof error;
+                    if (getsockopt(sock, SOL_SOCKET, SO_ERROR, &error, &length) != 0)
+                        error = errno;
+                }
+                break;
+            }
+        }
+    }
+    if (error == 0 && fcntl(sock, F_SETFL, flags) != 0)
+        error = errno;
+    return error;
 }
 
 bool isControl(char c)
@@ -447,10 +485,11 @@ int _MoxSendEmail(EmailConfig* config)
         memcpy(&address.sin_addr, host->h_addr_list[0], 4);
     }
 
-    if (connect(d.sock, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0)
-        return fail(d, 1, 3, errno, "Unable to connect to SMTP server[%s]");
-
     const unsigned limit = gs_limitMs.load();
+    int connectError = connectWithin(d.sock, address, limit > INT_MAX ? INT_MAX : static_cast<int>(limit));
+    if (connectError != 0)
+        return fail(d, 1, 3, connectError, "Unable to connect to SMTP server[%s]");
+
     // No send may block for longer than the limit, whatever the server does.
     timeval sendLimit{static_cast<time_t>(limit / 1000), static_cast<suseconds_t>((limit % 1000) * 1000)};
     setsockopt(d.sock, SOL_SOCKET, SO_SNDTIMEO, &sendLimit, sizeof sendLimit);
