@@ -26,11 +26,7 @@
 using Lines = std::vector<std::pair<int, std::string>>;
 
 class Provider : public ::testing::Test {
-protected:
-    std::string dir;
-    SLHandle* h = nullptr;
-    bool managing = false;
-
+public:
     static std::mutex& lock() { static std::mutex m; return m; }
     static Lines& logged() { static Lines l; return l; }
     // The lines logged since the last call.
@@ -39,6 +35,11 @@ protected:
         std::lock_guard<std::mutex> guard(lock());
         return std::exchange(logged(), {});
     }
+
+protected:
+    std::string dir;
+    SLHandle* h = nullptr;
+    bool managing = false;
 
     void SetUp() override
     {
