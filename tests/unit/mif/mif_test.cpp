@@ -9,7 +9,11 @@
 #include "mif/format.h"
 #include "provider.h"
 #include "sl/slaccess.h"
+#include "sl/slevent.h"
 #include "sl/slkey.h"
+#include "sl/slstring.h"
+#include <atomic>
+#include <thread>
 
 namespace {
 
@@ -132,6 +136,51 @@ TEST_F(Catalogue, ActionRowCopyClampsAHostileCount)
     EXPECT_EQ(FillActionTable(h, row), 0);
     EXPECT_EQ(row->count, 2) << "the two integers of the row";
     DeleteActionTable(row);
+}
+
+std::atomic<bool> deliveryRelease{false}, deliveryInside{false};
+void slowCompletion(void*)
+{
+    deliveryInside = true;
+    while (!deliveryRelease)
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+}
+
+// Cleanup while one command waits for a confirm that never comes, a second
+// waits for the command lock, and the provider is inside the indication
+// callback: cleanup returns only after all have left, the waiting command is
+// not sent, and the callback, finding no handler, makes no handle.
+TEST_F(Catalogue, CleanupWaitsForCommandsAndIndicationsUnderWay)
+{
+    SLHandle* second = SLCreateHandle(0);
+    const uint64_t calls = dmisp::commandsReceived();
+    const unsigned strings = slLiveStringCount();
+    dmisp::injectNoConfirm(1);
+    std::atomic<int> first{-1}, later{-1};
+    std::thread a([&] { first = SLListComponent(h, nullptr, board); });
+    while (dmisp::commandsReceived() == calls)
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    std::thread b([&] { later = SLListComponent(second, nullptr, board); });
+    uint32_t indication[13] = {SL_LEVEL_CHECK, 1, 52};
+    indication[11] = pointerWord(reinterpret_cast<void*>(&slowCompletion));
+    SLEventSetHandler(nullptr); // as cleanup leaves it
+    std::thread provider([&] { SLIndicationFunc(indication); });
+    std::atomic<bool> cleaned{false};
+    while (!deliveryInside)
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    EXPECT_EQ(slLiveStringCount(), strings) << "no handle made without a handler";
+    std::thread cleanup([&] { SLCleanup(); cleaned = true; });
+    std::this_thread::sleep_for(std::chrono::milliseconds(300));
+    EXPECT_FALSE(cleaned.load()) << "returned while the provider was inside the callback";
+    deliveryRelease = true;
+    for (std::thread* t : {&a, &b, &provider, &cleanup})
+        t->join();
+    EXPECT_EQ((std::vector<int>{first, later}), (std::vector<int>{1, 1}));
+    EXPECT_EQ(dmisp::commandsReceived() - calls, 1u) << "the waiting command was not sent";
+    componentList = nullptr; // freed with every other SL block
+    managing = false;
+    SLInitialize();
+    h = SLCreateHandle(0);
 }
 
 class Registration : public Provider {
