@@ -57,11 +57,10 @@ class Events : public Provider {
 protected:
     uint32_t component[4] = {};
     const ActionEntry* saved = nullptr;
-    int databases = 0;
 
     void start(OwnMif m)
     {
-        freshDatabase("db" + std::to_string(databases++));
+        freshDatabase();
         component[0] = install(ownMif(m));
         component[1] = install(boardMif("Test Board"));
         component[2] = install(boardMif("Other Board"));
@@ -80,40 +79,24 @@ protected:
         actionsSetHandlers(saved);
         Provider::TearDown();
     }
-    Codes deliver(uint32_t status)
+    // The actions run for an event of board `b` (0: a vendor error) with
+    // the voltage-probe row `key` (0: no instance).
+    Codes raise(int b, int key, int severity = 0, uint32_t group = 20)
     {
-        EXPECT_EQ(status, 0u);
+        dmisp::EventRow instance;
+        if (key != 0)
+            instance = {3, {std::to_string(key)}};
+        EXPECT_EQ(severity == 0 ? dmisp::raiseVendorEvent(component[b], {30, {}}, instance)
+                                : dmisp::raiseEvent(component[b], {group, {std::to_string(severity)}}, instance), 0u);
         EXPECT_TRUE(dmisp::waitIndicationsCompleted(10000));
         std::lock_guard<std::mutex> guard(lock());
         return std::exchange(recorded, {});
-    }
-    // An event of `group` (20 voltage, 21 the 6-attribute one) of board `b`
-    // with the voltage-probe row `key` (0: no instance).
-    Codes standard(int b, int key, int severity, uint32_t group = 20)
-    {
-        dmisp::EventRow instance;
-        if (key != 0)
-            instance = {3, {std::to_string(key)}};
-        return deliver(dmisp::raiseEvent(component[b], {group, {std::to_string(severity)}}, instance));
-    }
-    Codes vendor(int b, int key)
-    {
-        dmisp::EventRow instance;
-        if (key != 0)
-            instance = {3, {std::to_string(key)}};
-        return deliver(dmisp::raiseVendorEvent(component[b], {30, {}}, instance));
     }
 };
 
 TEST_F(Events, StandardRowSelection)
 {
-    struct Row {
-        const char* what;
-        std::vector<std::string> rows;
-        int board, key, severity;
-        uint32_t group;
-        Codes expected;
-    } rows[] = {
+    struct Row { const char* what; std::vector<std::string> rows; int board, key, severity; uint32_t group; Codes expected; } rows[] = {
         {"exact instance row", {stdRow("1, 20, 4, 1, 0, 0", {9, 8}), stdRow("1, 20, 4, 0, 0, 0", {7})}, 1, 1, 8, 20, {8, 9}},
         {"falls back to instance 0", {stdRow("1, 20, 4, 1, 0, 0", {9}), stdRow("1, 20, 4, 0, 0, 0", {7})}, 1, 2, 8, 20, {7}},
         {"disabled row, no fallback", {stdRow("1, 20, 4, 1, 0, 0", {8}, "0"), stdRow("1, 20, 4, 0, 0, 0", {7})},
@@ -121,7 +104,7 @@ TEST_F(Events, StandardRowSelection)
         {"baseboard severity 16 on the severity-0 row", {stdRow("1, 20, 4, 1, 0, 0", {16, 10})}, 1, 1, 16, 20, {10, 16}},
         {"other kinds by severity", {stdRow("2, 20, 4, 1, 0, 8", {9}), stdRow("2, 20, 4, 1, 0, 0", {7})}, 2, 1, 8, 20, {9}},
         {"unsupported component", {stdRow("1, 20, 4, 0, 0, 0", {8})}, 3, 1, 8, 20, {}},
-        {"a 6-attribute event row runs nothing", {stdRow("1, 21, 4, 0, 0, 0", {8})}, 1, 0, 8, 21, {}},
+        {"a 6-attribute event row runs nothing", {actionRow("1, 21, 4, 0, 0, 0", {8}, ", 1, 1, 0")}, 1, 0, 8, 21, {}},
         {"run order", {stdRow("1, 20, 4, 1, 0, 0", {7, 8, 9, 10, 11, 12, 13, 14, 15, 16, 18, 19, 20, 21, 22})}, 1, 1, 8,
          20, {8, 7, 9, 10, 16, 20, 19, 21, 22, 11, 12, 13, 14, 15, 18}},
     };
@@ -130,7 +113,7 @@ TEST_F(Events, StandardRowSelection)
         OwnMif m;
         m.standard = r.rows;
         start(m);
-        EXPECT_EQ(standard(r.board, r.key, r.severity, r.group), r.expected);
+        EXPECT_EQ(raise(r.board, r.key, r.severity, r.group), r.expected);
     }
     EXPECT_EQ(lastRecord.componentId, component[1]);
     EXPECT_EQ(lastRecord.eventGroupId, 20u);
@@ -141,7 +124,7 @@ TEST_F(Events, StandardRowSelection)
     m.actions = 6;
     m.standard = {stdRow("1, 20, 4, 1, 0, 0", {7, 8, 9, 10, 11, 12}, "1", 6)};
     start(m);
-    EXPECT_EQ(standard(1, 1, 8), (Codes{8, 7, 9, 10}));
+    EXPECT_EQ(raise(1, 1, 8), (Codes{8, 7, 9, 10}));
 }
 
 TEST_F(Events, VendorFallbackOrder)
@@ -150,11 +133,7 @@ TEST_F(Events, VendorFallbackOrder)
     const char* anyValue = "1, 3, 1, 1, -2147483648, 0";
     const char* anyInstance = "1, 3, 0, 1, 0, 0";
     const char* anyBoth = "1, 3, 0, 1, -2147483648, 0";
-    struct Row {
-        std::vector<std::string> rows;
-        int board, key;
-        Codes expected;
-    } rows[] = {
+    struct Row { std::vector<std::string> rows; int board, key; Codes expected; } rows[] = {
         {{vendorRow(exact, {8}), vendorRow(anyValue, {9}), vendorRow(anyInstance, {7}), vendorRow(anyBoth, {10})}, 1, 1, {8}},
         {{vendorRow(anyValue, {9}), vendorRow(anyInstance, {7}), vendorRow(anyBoth, {10})}, 1, 1, {9}},
         {{vendorRow(anyInstance, {7}), vendorRow(anyBoth, {10})}, 1, 1, {7}},
@@ -168,7 +147,7 @@ TEST_F(Events, VendorFallbackOrder)
         OwnMif m;
         m.vendor = r.rows;
         start(m);
-        EXPECT_EQ(vendor(r.board, r.key), r.expected);
+        EXPECT_EQ(raise(r.board, r.key), r.expected);
     }
     EXPECT_EQ(lastRecord.eventKind, 2u);
     EXPECT_EQ(lastRecord.errorState, 2u);
@@ -191,7 +170,7 @@ TEST_F(Events, RowClaimingBillionsOfAttributesEndsPromptly)
         }
         return 0;
     });
-    EXPECT_EQ(standard(1, 0, 8), Codes{8});
+    EXPECT_EQ(raise(1, 0, 8), Codes{8});
 }
 
 std::string hex(const AlarmRecord& a)
@@ -211,11 +190,7 @@ TEST(AlarmRecord, Bytes)
     SLKeyList key{};
     key.count = 1;
     key.keys[0] = {1, 5, &three};
-    struct Row {
-        uint32_t kind, group;
-        const char* groupName;
-        const char* bytes;
-    } rows[] = {
+    struct Row { uint32_t kind, group; const char* groupName; const char* bytes; } rows[] = {
         {1, 12, "Voltage Probe", "01000000070000000c00000009000000100000000300000001000000"},
         {1, 12, "Power Supply", "01000000070000000c00000009000000100000000300000001000000"},
         {1, 12, "power supply", "01000000070000000c00000009000000100000000300000000000000"},
@@ -223,20 +198,14 @@ TEST(AlarmRecord, Bytes)
     };
     for (const auto& r : rows) {
         EventRecord record{};
-        record.eventKind = r.kind;
-        record.componentId = 7;
-        record.groupId = r.group;
-        record.keyList = &key;
-        record.eventGroupId = 9;
-        record.severity = 16;
-        record.groupName = r.groupName;
+        record = {r.kind, 7, r.group, 0, 0, 0, &key, 9, 0, 16, 0, 0, nullptr, r.groupName, nullptr, nullptr, nullptr,
+                  nullptr, nullptr, nullptr};
         EXPECT_EQ(hex(makeAlarmRecord(&record)), r.bytes) << r.groupName;
     }
-    SLKeyList noValue{};
-    noValue.count = 1;
+    key.keys[0].value = nullptr;
     EventRecord record{};
     record.groupId = 4;
-    record.keyList = &noValue;
+    record.keyList = &key;
     EXPECT_EQ(getRowName(&record), 0u) << "a key without a value";
 }
 
@@ -249,11 +218,8 @@ TEST(AlarmHandOff, LocksAndPeers)
     char pattern[] = "/tmp/moxkobXXXXXX";
     const std::string dir = mkdtemp(pattern), lock = dir + "/kobLock", fifo = dir + "/kob";
     const KobPaths paths{lock.c_str(), fifo.c_str(), "/proc/%s/cmdline", 300};
-    struct Row {
-        const char* lock;    // null: no lock file; "%": a sleeper called `program`
-        const char* program;
-        bool lockKept, fifoKept;
-    } rows[] = {
+    // lock: null no lock file, "%" the pid of a sleeper called `program`.
+    struct Row { const char* lock; const char* program; bool lockKept, fifoKept; } rows[] = {
         {nullptr, "", false, true},      {"", "", false, false},         {"self\n", "", false, false},
         {"/etc/passwd\n", "", false, false}, {"12x\n", "", false, false}, {"999999999\n", "", true, true},
         {"%", "kobdx", false, false},    {"%", "/usr/sbin/kobd", false, false}, {"%", "kobd", true, true},
@@ -268,7 +234,8 @@ TEST(AlarmHandOff, LocksAndPeers)
                 execl("/bin/sleep", r.program, "20", static_cast<char*>(nullptr));
                 _exit(1);
             }
-            std::this_thread::sleep_for(std::chrono::milliseconds(50));
+            for (std::string cmd; cmd.rfind(r.program, 0) != 0;) // until the exec is done
+                std::getline(std::ifstream("/proc/" + std::to_string(pid) + "/cmdline"), cmd, '\0');
             std::ofstream(lock) << pid << "\n";
         } else if (r.lock != nullptr) {
             std::ofstream(lock) << r.lock;

@@ -6,7 +6,6 @@
 #include <gtest/gtest.h>
 
 #include <cstdio>
-#include <cstdlib>
 #include <filesystem>
 #include <mutex>
 #include <string>
@@ -30,16 +29,21 @@ public:
     static std::mutex& lock() { static std::mutex m; return m; }
     static Lines& logged() { static Lines l; return l; }
     // The lines logged since the last call.
-    static Lines lines()
+    static Lines lines() { std::lock_guard<std::mutex> guard(lock()); return std::exchange(logged(), {}); }
+    // A value as the provider holds it, or "status N".
+    static std::string value(uint32_t component, uint32_t group, uint32_t attribute,
+                             const std::vector<std::string>& keys = {})
     {
-        std::lock_guard<std::mutex> guard(lock());
-        return std::exchange(logged(), {});
+        std::string v;
+        uint32_t status = dmisp::getValue(component, group, attribute, keys, &v);
+        return status == 0 ? v : "status " + std::to_string(status);
     }
 
 protected:
     std::string dir;
     SLHandle* h = nullptr;
     bool managing = false;
+    int databases = 0;
 
     void SetUp() override
     {
@@ -48,8 +52,7 @@ protected:
         char pattern[] = "/tmp/moxunitXXXXXX";
         ASSERT_NE(mkdtemp(pattern), nullptr);
         dir = pattern;
-        std::string error;
-        ASSERT_EQ(dmisp::reset(dir + "/db", false, &error), 0) << error;
+        freshDatabase();
         setenv("UXDMIPATH", (dir + "/mifs").c_str(), 1);
         lines();
         moxSetLogHook([](int priority, const char* text) {
@@ -58,8 +61,7 @@ protected:
         });
         moxNewKeyFormat = moxActionTableGroup = -1;
         RegisterWithSLCalls(RegistrationCalls{EventHandler, [] { SysCtrlInitialize(); LcdInitialize(); }});
-        h = SLCreateHandle(0);
-        ASSERT_NE(h, nullptr);
+        ASSERT_NE(h = SLCreateHandle(0), nullptr);
     }
 
     void TearDown() override
@@ -77,36 +79,30 @@ protected:
     }
 
     // Without RegisterWithSL, the provider confirms only to a management application.
-    void manage()
-    {
-        ASSERT_EQ(SLDmiRegisterMgmt(h, [](SLHandle*) { return 0; }), 0);
-        managing = true;
-    }
+    void manage() { ASSERT_EQ(SLDmiRegisterMgmt(h, [](SLHandle*) { return 0; }), 0); managing = true; }
 
-    // A new empty database (and catalogue) within the test.
-    void freshDatabase(const std::string& name)
+    // A new empty database and catalogue; registration ended.
+    void freshDatabase()
     {
         UnregisterWithSL();
         forget();
         std::string error;
-        ASSERT_EQ(dmisp::reset(dir + "/" + name, false, &error), 0) << error;
-        if (managing) {
-            ASSERT_EQ(SLDmiRegisterMgmt(h, [](SLHandle*) { return 0; }), 0);
-        }
+        ASSERT_EQ(dmisp::reset(dir + "/db" + std::to_string(databases++), false, &error), 0) << error;
+        if (managing)
+            manage();
     }
 
     static void forget()
     {
         deleteComponentList(componentList);
         componentList = nullptr;
-        LcdGroupId = LcdContentsAttrId = 0;
-        sysCtrlGroup = sysCtrlComponent = PagingGroupId = 0;
+        LcdGroupId = LcdContentsAttrId = sysCtrlGroup = sysCtrlComponent = PagingGroupId = 0;
     }
 
-    static uint32_t install(const std::string& text, const std::string& name = "test.mif")
+    static uint32_t install(const std::string& text)
     {
         std::string error;
-        uint32_t id = dmisp::installText(text, name, &error);
+        uint32_t id = dmisp::installText(text, "test.mif", &error);
         EXPECT_NE(id, 0u) << error;
         return id;
     }
@@ -137,12 +133,4 @@ protected:
         entry->mifId = mifId;
     }
 
-    // A value as the provider holds it, or "status N".
-    static std::string value(uint32_t component, uint32_t group, uint32_t attribute,
-                             const std::vector<std::string>& keys = {})
-    {
-        std::string v;
-        uint32_t status = dmisp::getValue(component, group, attribute, keys, &v);
-        return status == 0 ? v : "status " + std::to_string(status);
-    }
 };
