@@ -24,7 +24,7 @@ protected:
     void withBaseboard(std::initializer_list<std::string> groups)
     {
         freshDatabase();
-        board = groups.size() == 0 ? installShipped("baseboard.mif") : install(mifComponent("Board", groups));
+        board = groups.size() == 0 ? install("baseboard.mif", true) : install(mifComponent("Board", groups));
         catalogue(board, 1);
     }
 };

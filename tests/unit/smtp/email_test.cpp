@@ -12,7 +12,7 @@ class Email : public Provider {};
 
 TEST_F(Email, FromTheBaseboardSettingsAsTheServerReceivesIt)
 {
-    uint32_t board = installShipped("baseboard.mif");
+    uint32_t board = install("baseboard.mif", true);
     manage();
     catalogue(board, 1);
     char host[MOX_HOST_NAME_SIZE] = {};

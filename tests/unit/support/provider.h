@@ -5,7 +5,7 @@
 
 #include <gtest/gtest.h>
 
-#include <cstdio>
+#include <fstream>
 #include <filesystem>
 #include <mutex>
 #include <string>
@@ -47,8 +47,7 @@ protected:
 
     void SetUp() override
     {
-        static bool slReady = (SLInitialize(), true);
-        (void)slReady;
+        [[maybe_unused]] static bool slReady = (SLInitialize(), true);
         char pattern[] = "/tmp/moxunitXXXXXX";
         ASSERT_NE(mkdtemp(pattern), nullptr);
         dir = pattern;
@@ -99,18 +98,12 @@ protected:
         LcdGroupId = LcdContentsAttrId = sysCtrlGroup = sysCtrlComponent = PagingGroupId = 0;
     }
 
-    static uint32_t install(const std::string& text)
+    // Installs MIF text, or with `shipped` the file of that name in mifs/.
+    static uint32_t install(const std::string& text, bool shipped = false)
     {
         std::string error;
-        uint32_t id = dmisp::installText(text, "test.mif", &error);
-        EXPECT_NE(id, 0u) << error;
-        return id;
-    }
-
-    static uint32_t installShipped(const std::string& file)
-    {
-        std::string error;
-        uint32_t id = dmisp::install(MOX_SOURCE_DIR "/mifs/" + file, &error);
+        uint32_t id = shipped ? dmisp::install(MOX_SOURCE_DIR "/mifs/" + text, &error)
+                              : dmisp::installText(text, "test.mif", &error);
         EXPECT_NE(id, 0u) << error;
         return id;
     }
@@ -119,9 +112,7 @@ protected:
     void ownMifFile(const std::string& text)
     {
         std::filesystem::create_directories(dir + "/mifs");
-        FILE* f = fopen((dir + "/mifs/mox.mif").c_str(), "w");
-        fputs(text.c_str(), f);
-        fclose(f);
+        std::ofstream(dir + "/mifs/mox.mif") << text;
     }
 
     // Puts `component` into the catalogue with MIF id `mifId` (1: the baseboard).
