@@ -101,6 +101,7 @@ void slowCompletion(void*)
 // not sent, and the callback, finding no handler, makes no handle.
 TEST_F(Catalogue, CleanupWaitsForCommandsAndIndicationsUnderWay)
 {
+    ASSERT_TRUE(dmisp::waitIndicationsCompleted(10000)); // the installs' own indications
     SLHandle* second = SLCreateHandle(0);
     const uint64_t calls = dmisp::commandsReceived();
     const unsigned strings = slLiveStringCount();
