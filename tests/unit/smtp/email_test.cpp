@@ -9,10 +9,9 @@
 #include "daemon/events.h"
 #include "hardware/lcd.h"
 #include "hardware/sysctrl.h"
-#include "scripted_server.h"
+#include "smtppeer.h"
 #include "sl/sl.h"
 #include "smtp/email.h"
-#include "smtp_test_support.h"
 
 namespace {
 

@@ -1,0 +1,249 @@
+#include <gtest/gtest.h>
+
+#include <fstream>
+#include <string>
+#include <sys/wait.h>
+#include <syslog.h>
+#include <unistd.h>
+#include <vector>
+
+#include "actions/actions.h"
+#include "actions/uxaction.h"
+#include "base/log.h"
+#include "base/sleep.h"
+#include "base/strcase.h"
+#include "hardware/sysaction.h"
+#include "simdriver.h"
+#include "sl/slhandle.h"
+
+namespace {
+
+std::string calls;
+std::vector<std::pair<int, std::string>> lines;
+int shutDowns = 0;
+std::vector<unsigned> sleeps;
+
+TEST(Dispatch, RunOrderSwitchPositionsAndFirstMatch)
+{
+    std::string order;
+    for (const ActionOrder* e = ActionID; e->code != 0; ++e)
+        order += std::to_string(e->code) + "@" + std::to_string(e->position) + " ";
+    EXPECT_EQ(order, "8@1 7@0 9@2 10@3 16@9 20@13 19@12 21@14 22@15 11@4 12@5 13@6 14@7 15@8 18@11 ");
+    static const ActionEntry table[] = {
+        {8, [](SLHandle*, EventRecord*) { calls += "8 "; return 0; }},
+        {8, [](SLHandle*, EventRecord*) { calls += "second "; return 0; }},
+        {20, [](SLHandle*, EventRecord*) { calls += "20 "; return 0; }},
+        {0, nullptr},
+    };
+    const ActionEntry* saved = actionsSetHandlers(table);
+    EventRecord record{};
+    DoAction(8, 0, nullptr, &record);  // switched off
+    DoAction(8, 1, nullptr, &record);  // first match only
+    DoAction(20, 5, nullptr, &record); // any non-zero switch
+    DoAction(17, 1, nullptr, &record); // the alert name is no action
+    actionsSetHandlers(saved);
+    EXPECT_EQ(calls, "8 20 ");
+}
+
+class SystemActions : public SimDriverTest {
+protected:
+    void SetUp() override
+    {
+        SimDriverTest::SetUp();
+        shutDowns = 0;
+        moxSetShutDownFunction([] { return ++shutDowns, -1; });
+        moxSetSleepHook([](unsigned) {});
+    }
+    void TearDown() override
+    {
+        moxSetShutDownFunction(nullptr);
+        moxSetSleepHook(nullptr);
+        MoxActionCapabilityWord = 0x7FF;
+        bNotificationOnly = 0;
+        SimDriverTest::TearDown();
+    }
+};
+
+// Each wrapper asks for its own capability bit, then passes its code and delay
+// on; `word` holds that bit and whatever the code needs below.
+TEST_F(SystemActions, CapabilityCodeAndDelayOfEachWrapper)
+{
+    const std::string armed = "watchdog set: use 0x04 action ";
+    const std::string started = " countdown 1; watchdog started: countdown 1; ";
+    struct Row {
+        const char* name;
+        ActionHandler handler;
+        uint32_t bit, word;
+        std::string effect;
+        int shutDowns;
+    } rows[] = {
+        {"shutdownOS", shutdownOS, 0x08, 0x08, "", 1},
+        {"shutdownAndPowerOff", shutdownAndPowerOff, 0x40, 0xC0, "shutdown code 2 delay 400; ", 1},
+        {"shutdownAndresetsystem", shutdownAndresetsystem, 0x10, 0x30, "shutdown code 1 delay 400; ", 1},
+        {"powerOff", powerOff, 0x01, 0x01, armed + "power down" + started, 0},
+        {"resetSystem", resetSystem, 0x02, 0x02, armed + "hard reset" + started, 0},
+        {"issueNMI", issueNMI, 0x04, 0x04, "chassis control: nmi; ", 0},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.name);
+        for (int run = 0; run < 3; ++run) {
+            SetUp();
+            // 0: allowed; 1: its bit missing; 2: notifications only.
+            MoxActionCapabilityWord = run == 1 ? 0x7FF & ~row.bit : run == 0 ? row.word : 0x7FF;
+            bNotificationOnly = run == 2 ? 1 : 0;
+            EventRecord record{};
+            EXPECT_EQ(row.handler(nullptr, &record), 0);
+            EXPECT_EQ(actions(), run == 0 ? row.effect : "") << run;
+            EXPECT_EQ(shutDowns, run == 0 ? row.shutDowns : 0) << run;
+            TearDown();
+        }
+    }
+}
+
+TEST(Notify, LogPrioritiesAndBell)
+{
+    struct Row {
+        uint32_t kind, severity;
+        int priority;
+        std::string line;
+    } rows[] = {
+        {EVENT_STANDARD, 1, LOG_INFO, "TYPE:Warm COMPONENT:Unknown GROUP:Fan SEVERITY:Unknown ROW:Not Applicable "
+                                      "SYSTEM:Unknown SUBSYSTEM:Unknown\n"},
+        {EVENT_STANDARD, 2, LOG_INFO, ""},      {EVENT_STANDARD, 4, LOG_INFO, ""},
+        {EVENT_STANDARD, 8, LOG_WARNING, ""},   {EVENT_STANDARD, 16, LOG_ERR, ""},
+        {EVENT_STANDARD, 32, LOG_ERR, ""},      {EVENT_UNKNOWN, 1, LOG_NOTICE, "DMI Unknown Indication Unknown\n"},
+    };
+    moxSetLogHook([](int priority, const char* text) { lines.emplace_back(priority, text); });
+    for (const Row& row : rows) {
+        lines.clear();
+        EventRecord record{};
+        record.eventKind = row.kind;
+        record.severity = row.severity;
+        record.eventTypeText = "Warm";
+        record.groupName = "Fan";
+        LogEvent(nullptr, &record);
+        ASSERT_EQ(lines.size(), 1u) << row.severity;
+        EXPECT_EQ(lines[0].first, row.priority) << row.kind << " severity " << row.severity;
+        EXPECT_TRUE(row.line.empty() || lines[0].second == row.line) << lines[0].second;
+    }
+    moxSetLogHook(nullptr);
+    int saved = dup(1), pipeEnds[2];
+    ASSERT_EQ(pipe(pipeEnds), 0);
+    dup2(pipeEnds[1], 1);
+    BeepSpeaker(nullptr, nullptr);
+    dup2(saved, 1);
+    char bell = 0;
+    EXPECT_EQ(read(pipeEnds[0], &bell, 1), 1);
+    EXPECT_EQ(bell, '\a');
+    close(pipeEnds[0]), close(pipeEnds[1]), close(saved);
+}
+
+TEST(Notify, RowLabelFallsBackToTheFirstKey)
+{
+    uint32_t value = 42;
+    SLKeyList withValue{}, withoutValue{};
+    withValue.count = withoutValue.count = 1;
+    withValue.keys[0] = {1, 5, &value};
+    withoutValue.keys[0] = {1, 5, nullptr};
+    SLHandle* handle = SLCreateHandle(0);
+    for (auto [keys, label] : {std::pair<SLKeyList*, std::string>{nullptr, "Not Applicable"}, {&withValue, "42"},
+                               {&withoutValue, "Not Applicable"}}) {
+        EventRecord record{};
+        record.keyList = keys;
+        char out[64];
+        rowLabel(handle, &record, out, sizeof out);
+        EXPECT_EQ(out, label);
+    }
+    SLDestroyHandle(handle);
+}
+
+TEST(OsServices, CaseInsensitiveComparisons)
+{
+    struct Row {
+        const char *a, *b;
+        int n; // -1: stricmp
+        int expected;
+    } rows[] = {
+        {"ZOREK|error", "Zorek|Error", 11, 0}, {"EventGeneration", "EventGeneration|", 16, -1},
+        {"abc", "abd", 2, 0},                  {"abd", "ABC", 3, 1},
+        {"abc", "abcdef", -1, -1},             {"Same", "sAME", -1, 0},
+        {nullptr, "", -1, -1},                 {"", nullptr, -1, 1},
+        {nullptr, nullptr, -1, 0},             {"x", "y", 0, 0},
+        {"\xe9", "a", 1, -1},                  {"a", "z", 1, -1},
+    };
+    for (const Row& r : rows)
+        EXPECT_EQ(r.n < 0 ? stricmp(r.a, r.b) : strnicmp(r.a, r.b, r.n), r.expected)
+            << (r.a ? r.a : "null") << " / " << (r.b ? r.b : "null") << " n=" << r.n;
+}
+
+TEST(OsServices, NotificationOnlyRule)
+{
+    struct Row {
+        std::string content;
+        uint32_t before, after;
+    } rows[] = {
+        {"NotificationOnly = TRUE\n", 0, 1},
+        {"notificationonly=false\n", 1, 0},
+        {"# notificationonly = true\n", 0, 0},
+        {"   # notificationonly = true\n", 0, 1}, // '#' counts only in the first column
+        {"notificationonly = true\nnotificationonly = false\n", 0, 0},
+        {"notificationonly = false\nother\n", 1, 0},
+        {"other = true\n", 0, 0},
+        {std::string(490, 'x') + "notificationonly = true\n", 0, 0}, // split over two pieces
+        {std::string(600, 'y') + " notificationonly true\n", 0, 1},
+    };
+    char pattern[] = "/tmp/moxcfgXXXXXX";
+    std::string path = std::string(mkdtemp(pattern)) + "/mox.cfg";
+    for (const Row& row : rows) {
+        std::ofstream(path) << row.content;
+        bNotificationOnly = row.before;
+        EXPECT_EQ(processCfgFile(path.c_str()), 1);
+        EXPECT_EQ(bNotificationOnly, row.after) << row.content;
+    }
+    EXPECT_EQ(processCfgFile((path + ".missing").c_str()), 0);
+    bNotificationOnly = 0;
+}
+
+TEST(OsServices, DelaySleepsWholeSecondsAtLeastOne)
+{
+    moxSetSleepHook([](unsigned ms) { sleeps.push_back(ms); });
+    for (int32_t ms : {3000, 2999, 999, 0, -5, 40000})
+        MoxDelay(ms);
+    moxSetSleepHook(nullptr);
+    EXPECT_EQ(sleeps, (std::vector<unsigned>{3000, 2000, 1000, 1000, 1000, 40000}));
+}
+
+TEST(OsServices, ShutdownExecutesInitZeroWithNoBlockedSignals)
+{
+    // /bin/sh started as "init" "0" runs the script "0" of its working
+    // directory, which records its command line and blocked signals with
+    // builtins only.
+    char pattern[] = "/tmp/moxinitXXXXXX";
+    std::string dir = mkdtemp(pattern);
+    std::ofstream(dir + "/0") << "while read key value; do case $key in SigBlk:) b=$value;; esac; done < /proc/$$/status\n"
+                                 "tr '\\000' ' ' < /proc/$$/cmdline > record\necho \"/$b\" >> record\n";
+    pid_t child = fork();
+    if (child == 0) {
+        sigset_t all;
+        sigfillset(&all);
+        pthread_sigmask(SIG_SETMASK, &all, nullptr);
+        if (chdir(dir.c_str()) == 0)
+            shutDownOsWith("/bin/sh");
+        _exit(99);
+    }
+    int status = 0;
+    waitpid(child, &status, 0);
+    EXPECT_EQ(status, 0);
+    std::ifstream in(dir + "/record");
+    std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    EXPECT_EQ(text, "init 0 /0000000000000000\n");
+    lines.clear();
+    moxSetLogHook([](int priority, const char* t) { lines.emplace_back(priority, t); });
+    EXPECT_EQ(shutDownOsWith("/nonexistent/init"), -1);
+    moxSetLogHook(nullptr);
+    ASSERT_EQ(lines.size(), 1u);
+    EXPECT_EQ(lines[0], std::make_pair(LOG_ERR, std::string("MOX - cannot execute /nonexistent/init for the OS "
+                                                            "shutdown: No such file or directory\n")));
+}
+
+} // namespace
