@@ -34,7 +34,7 @@ TEST_F(Obx, RequestRecords)
         std::string log;     // a line the driver logged, if any
     } rows[] = {
         {"identity on first use", [] { return open_obx() == 1 ? 0 : 1; },
-         "flags 0 timeout 400000 to 0x20 netfn 0x06 cmd 0x01 lun 0 data", "get device id"},
+         "flags 0 timeout 400000 to 0x20 netfn 0x06 cmd 0x01 lun 0 data", ""},
         {"timed", [&] { const ObxpRequest r = {0x02, 0x20, 0, 0x00, 0, data, 1};
                         uint8_t out[64], cc; uint32_t n; return SendTimedObxpRequest(&r, 3, out, &n, &cc); },
          "flags 0 timeout 3000 to 0x20 netfn 0x00 cmd 0x02 lun 0 data 7", ""},

@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 
+#include <numeric>
 #include <optional>
 #include <string>
 #include <syslog.h>
@@ -9,90 +10,59 @@
 
 namespace {
 
-class Smtp : public testing::Test {
-protected:
-    void SetUp() override
-    {
-        LogCapture::take();
-        moxSetLogHook(LogCapture::hook);
-        moxSetSleepHook(SleepCapture::hook);
-        smtpSetLimitMs(300);
-    }
-    void TearDown() override
-    {
-        moxSetLogHook(nullptr);
-        moxSetSleepHook(nullptr);
-        smtpSetWritableHook(nullptr);
-        smtpSetLimitMs(8000);
-        smtpSetPort(25);
-    }
-};
-
-int writable = 0; // writability waits that succeed before they all fail
+int writable = 0; // writability waits that succeed before every later one fails
 
 std::string failed(int step, int code)
 {
-    return "mox - Email Alert failed - smtp command failed in step[" + std::to_string(step) + "]!,ErrorCode:[" +
-           std::to_string(code) + "], Reason: Mox email alert was not sent The server[127.0.0.1] returned the "
-           "following value:[" + std::to_string(code) + "] The last command returned the following values:" +
-           std::to_string(step) + ", " + std::to_string(code) + "\n\n";
+    std::string s = std::to_string(step), c = std::to_string(code);
+    return "mox - Email Alert failed - smtp command failed in step[" + s + "]!,ErrorCode:[" + c + "], Reason: Mox "
+           "email alert was not sent The server[127.0.0.1] returned the following value:[" + c + "] The last command "
+           "returned the following values:" + s + ", " + c + "\n\n";
 }
 
-TEST_F(Smtp, DialogueStagesAndFailureLines)
+TEST(Smtp, DialogueStagesAndFailureLines)
 {
     const PeerScript ok = acceptingScript(1);
-    auto upTo = [&ok](size_t stage, std::string reply) {
-        PeerScript s(ok.begin(), ok.begin() + static_cast<long>(stage) + 1);
+    auto upTo = [&ok](long stage, std::string reply, PeerScript more = {}) {
+        PeerScript s(ok.begin(), ok.begin() + stage + 1);
         s.back().second = reply;
+        s.insert(s.end(), more.begin(), more.end());
         return s;
     };
-    PeerScript subject = upTo(4, "354 go\r\n");
-    subject.push_back({"SUBJECT:s\r\n", "250 ok\r\n"});
     const std::string commands[] = {"HELO 127.0.0.1\r\n", "MAIL FROM:<a@x>\r\n", "RCPT TO:<b@y>\r\n", "DATA\r\n",
                                     "SUBJECT:s\r\n",      "b\r\n.\r\n",           "QUIT\r\n"};
-    auto sent = [&commands](int n) {
-        std::string text;
-        for (int i = 0; i < n; ++i)
-            text += commands[i];
-        return text;
-    };
+    auto sent = [&commands](int n) { return std::accumulate(commands, commands + n, std::string()); };
+    const std::string socketsLine = "mox - Email Alert failed - sockets library error! Error Value=";
     struct Row {
         const char* name;
         PeerScript script; // empty: nobody listens
-        std::string received;
-        std::string log; // empty: delivered
-        std::string sender = "a@x", recipients = "b@y", subject = "s", body = "b\n";
+        std::string received, log; // log empty: delivered
         int writable = 1000;
+        std::string sender = "a@x", recipients = "b@y", subject = "s", body = "b\n";
     } rows[] = {
-        {.name = "delivered, three recipients, control bytes blanked, dots doubled",
-         .script = acceptingScript(3),
-         .received = "HELO 127.0.0.1\r\nMAIL FROM:<a@x  RSET>\r\nRCPT TO:<b@y>\r\nRCPT TO:< c@z>\r\nRCPT TO:<d@w>\r\n"
-                     "DATA\r\nSUBJECT:s t\r\none\r\n..two\r\nthr ee\r\n.\r\nQUIT\r\n",
-         .log = "",
-         .sender = "a@x\r\nRSET",
-         .recipients = "b@y, c@z;;d@w",
-         .subject = "s\nt",
-         .body = "one\n.two\r\nthr\x01" "ee"},
-        {.name = "greeting", .script = upTo(0, "421 busy\r\n"), .received = "", .log = failed(5, 421)},
-        {.name = "HELO", .script = upTo(1, "500 no\r\n"), .received = sent(1), .log = failed(8, 500)},
-        {.name = "MAIL", .script = upTo(2, "550 no\r\n"), .received = sent(2), .log = failed(11, 550)},
-        {.name = "RCPT", .script = upTo(3, "251 fwd\r\n"), .received = sent(3), .log = failed(14, 251)},
-        {.name = "DATA", .script = upTo(4, "554 no\r\n"), .received = sent(4), .log = failed(17, 554)},
-        {.name = "SUBJECT answered", .script = subject, .received = sent(5), .log = failed(20, 250)},
-        {.name = "body", .script = upTo(5, "451 later\r\n"), .received = sent(6), .log = failed(23, 451)},
-        {.name = "QUIT", .script = upTo(6, "500 no\r\n"), .received = sent(7), .log = failed(26, 500)},
-        {.name = "recipient never writable",
-         .script = upTo(2, "250 ok\r\n"),
-         .received = sent(2),
-         .log = "mox - Email Alert failed - sockets library error! Error Value=110,Reason:Mox email alert was not sent "
-                "A communication error occured... The last command returned the following values:12, 110\n\n",
-         .writable = 2},
-        {.name = "connection refused",
-         .script = {},
-         .received = "",
-         .log = "mox - Email Alert failed - sockets library error! Error Value=111,Reason:Mox email alert was not sent "
-                "Unable to connect to SMTP server[127.0.0.1] The last command returned the following values:3, 111\n\n"},
+        {"delivered; control bytes blanked, dots doubled", acceptingScript(3),
+         "HELO 127.0.0.1\r\nMAIL FROM:<a@x  RSET>\r\nRCPT TO:<b@y>\r\nRCPT TO:< c@z>\r\nRCPT TO:<d@w>\r\nDATA\r\n"
+         "SUBJECT:s t\r\none\r\n..two\r\nthr ee\r\n.\r\nQUIT\r\n",
+         "", 1000, "a@x\r\nRSET", "b@y, c@z;;d@w", "s\nt", "one\n.two\r\nthr\x01" "ee"},
+        {"greeting", upTo(0, "421 busy\r\n"), sent(0), failed(5, 421)},
+        {"HELO", upTo(1, "500 no\r\n"), sent(1), failed(8, 500)},
+        {"MAIL", upTo(2, "550 no\r\n"), sent(2), failed(11, 550)},
+        {"RCPT", upTo(3, "251 fwd\r\n"), sent(3), failed(14, 251)},
+        {"DATA", upTo(4, "554 no\r\n"), sent(4), failed(17, 554)},
+        {"subject answered", upTo(4, "354 go\r\n", {{"SUBJECT:s\r\n", "250 ok\r\n"}}), sent(5), failed(20, 250)},
+        {"body", upTo(5, "451 later\r\n"), sent(6), failed(23, 451)},
+        {"QUIT", upTo(6, "500 no\r\n"), sent(7), failed(26, 500)},
+        {"recipient never writable", upTo(2, "250 ok\r\n"), sent(2),
+         socketsLine + "110,Reason:Mox email alert was not sent A communication error occured... The last command "
+                       "returned the following values:12, 110\n\n", 2},
+        {"connection refused", {}, "",
+         socketsLine + "111,Reason:Mox email alert was not sent Unable to connect to SMTP server[127.0.0.1] The last "
+                       "command returned the following values:3, 111\n\n"},
     };
+    moxSetLogHook(LogCapture::hook);
+    moxSetSleepHook(SleepCapture::hook);
+    smtpSetLimitMs(300);
+    smtpSetWritableHook([](int, int) { return writable-- > 0; });
     for (Row& row : rows) {
         SCOPED_TRACE(row.name);
         std::optional<ScriptedServer> peer;
@@ -100,7 +70,6 @@ TEST_F(Smtp, DialogueStagesAndFailureLines)
             peer.emplace(row.script);
         smtpSetPort(peer ? peer->port() : 1);
         writable = row.writable;
-        smtpSetWritableHook([](int, int) { return writable-- > 0; });
         std::string server = "127.0.0.1";
         EmailConfig config{server.data(), row.sender.data(), row.recipients.data(), row.subject.data(),
                            row.body.data()};
@@ -108,15 +77,16 @@ TEST_F(Smtp, DialogueStagesAndFailureLines)
         EXPECT_EQ(_MoxSendEmail(&config), row.log.empty() ? 1 : 0);
         std::string err = testing::internal::GetCapturedStderr();
         EXPECT_EQ(peer ? peer->received() : "", row.received);
-        auto lines = LogCapture::take();
-        EXPECT_EQ(lines.size(), row.log.empty() ? 0u : 1u);
-        for (const auto& [priority, text] : lines)
-            EXPECT_EQ(std::make_pair(priority, text), std::make_pair(LOG_INFO, row.log));
+        using Lines = std::vector<std::pair<int, std::string>>;
+        EXPECT_EQ(LogCapture::take(), (row.log.empty() ? Lines{} : Lines{{LOG_INFO, row.log}}));
         EXPECT_EQ(err.empty(), row.log.empty()) << err;
     }
+    moxSetLogHook(nullptr);
+    moxSetSleepHook(nullptr);
+    smtpSetWritableHook(nullptr);
 }
 
-TEST_F(Smtp, ReplyPiecesAndLineEnds)
+TEST(Smtp, ReplyPiecesAndLineEnds)
 {
     struct Row {
         std::vector<std::string> pieces;
@@ -127,11 +97,12 @@ TEST_F(Smtp, ReplyPiecesAndLineEnds)
         {{"250 a\n\n"}, 0, 1024, 7, "250 a\n\n"},
         {{"250 a\n\r"}, 0, 1024, 7, "250 a\n\r"},
         {{"250 a\r\r"}, 0, 1024, 7, "250 a\r\r"},
-        {{"250 a\n"}, 0, 1024, 0, ""},                                // one line feed is no line end
-        {{std::string("250 a\0b\r\n", 9)}, 0, 1024, 5, "250 a"},     // up to a NUL
-        {{"250 a\r\n"}, 0, 4, 3, "250"},                              // cut to the caller's size
-        {{"2", "5", "0", " ", "a", "\r", "\n"}, 60, 1024, 0, ""},    // one limit for the whole reply
+        {{"250 a\n"}, 0, 1024, 0, ""},                            // one line feed ends nothing
+        {{std::string("250 a\0b\r\n", 9)}, 0, 1024, 5, "250 a"}, // up to a NUL
+        {{"250 a\r\n"}, 0, 4, 3, "250"},                          // cut to the caller's size
+        {{"2", "5", "0", " ", "a", "\r", "\n"}, 60, 1024, 0, ""}, // one limit for the whole reply
     };
+    smtpSetLimitMs(300);
     for (const Row& row : rows) {
         int ends[2];
         ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, ends), 0);
@@ -149,16 +120,14 @@ TEST_F(Smtp, ReplyPiecesAndLineEnds)
     }
 }
 
-TEST(SmtpRules, RecipientSplitting)
+TEST(Smtp, RecipientSplitting)
 {
     struct Row {
         const char* list;
         size_t length;
         std::string items;
-    } rows[] = {
-        {"a@x,b@y;;c@z", 125, "[a@x][b@y][c@z]"}, {",;;,", 125, ""},
-        {" a , b", 125, "[ a ][ b]"},           {"abc;def", 5, "[abc][d]"},
-    };
+    } rows[] = {{"a@x,b@y;;c@z", 125, "[a@x][b@y][c@z]"}, {",;;,", 125, ""}, {" a , b", 125, "[ a ][ b]"},
+                {"abc;def", 5, "[abc][d]"}};
     for (const Row& row : rows) {
         std::string items;
         size_t position = 0, start = 0, length = 0;

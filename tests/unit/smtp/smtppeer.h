@@ -5,11 +5,8 @@
 #pragma once
 
 #include <arpa/inet.h>
-#include <mutex>
-#include <netinet/in.h>
 #include <poll.h>
 #include <string>
-#include <sys/socket.h>
 #include <thread>
 #include <unistd.h>
 #include <utility>
@@ -24,22 +21,16 @@ class ScriptedServer {
 public:
     explicit ScriptedServer(PeerScript script)
     {
-        listener_ = socket(AF_INET, SOCK_STREAM, 0);
-        sockaddr_in address{};
-        address.sin_family = AF_INET;
-        address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-        bind(listener_, reinterpret_cast<sockaddr*>(&address), sizeof address);
-        listen(listener_, 1);
+        sockaddr_in address{AF_INET, 0, {htonl(INADDR_LOOPBACK)}, {}};
         socklen_t length = sizeof address;
+        listener_ = socket(AF_INET, SOCK_STREAM, 0);
+        bind(listener_, reinterpret_cast<sockaddr*>(&address), length);
+        listen(listener_, 1);
         getsockname(listener_, reinterpret_cast<sockaddr*>(&address), &length);
         port_ = ntohs(address.sin_port);
         thread_ = std::thread([this, script] { run(script); });
     }
-    ~ScriptedServer()
-    {
-        received();
-        close(listener_);
-    }
+    ~ScriptedServer() { received(), close(listener_); }
     uint16_t port() const { return port_; }
     const std::string& received()
     {
@@ -49,23 +40,21 @@ public:
     }
 
 private:
-    // Within a 10-second guard; false at the end of the stream.
+    // Waits for bytes within a 10-second guard; false at the end of the stream.
     bool readSome(int fd)
     {
         pollfd p{fd, POLLIN, 0};
         char buffer[4096];
         ssize_t got = poll(&p, 1, 10000) > 0 ? recv(fd, buffer, sizeof buffer, 0) : 0;
-        if (got > 0)
-            received_.append(buffer, static_cast<size_t>(got));
+        received_.append(buffer, got > 0 ? static_cast<size_t>(got) : 0);
         return got > 0;
     }
     void run(const PeerScript& script)
     {
         pollfd p{listener_, POLLIN, 0};
         int fd = poll(&p, 1, 10000) > 0 ? accept(listener_, nullptr, nullptr) : -1;
-        size_t cursor = 0;
+        size_t cursor = 0, found = 0;
         for (const auto& [awaited, reply] : script) {
-            size_t found = 0;
             while (fd >= 0 && (found = received_.find(awaited, cursor)) == std::string::npos)
                 if (!readSome(fd))
                     return (void)close(fd);
@@ -76,43 +65,28 @@ private:
         }
         close(fd);
     }
-
     int listener_ = -1;
     uint16_t port_ = 0;
     std::thread thread_;
     std::string received_;
 };
 
-// Accepts everything: nothing is answered to the subject line.
+// Accepts everything; answers nothing to the subject line.
 inline PeerScript acceptingScript(int recipients)
 {
     PeerScript s = {{"", "220 mx.test ESMTP\r\n"}, {"\r\n", "250 mx.test\r\n"}, {"\r\n", "250 2.1.0 Ok\r\n"}};
-    for (int i = 0; i < recipients; i++)
-        s.push_back({"\r\n", "250 2.1.5 Ok\r\n"});
+    s.insert(s.end(), recipients, {"\r\n", "250 2.1.5 Ok\r\n"});
     s.insert(s.end(), {{"DATA\r\n", "354 End data\r\n"}, {"\r\n.\r\n", "250 2.0.0 Ok\r\n"}, {"QUIT\r\n", "221 Bye\r\n"}});
     return s;
 }
 
-// The system log and the sleeps, captured.
+// The system log and the sleeps, captured (the client logs on the caller's thread).
 struct LogCapture {
-    static inline std::mutex mutex;
     static inline std::vector<std::pair<int, std::string>> lines;
-    static void hook(int priority, const char* text)
-    {
-        std::lock_guard<std::mutex> lock(mutex);
-        lines.emplace_back(priority, text);
-    }
-    static std::vector<std::pair<int, std::string>> take()
-    {
-        std::lock_guard<std::mutex> lock(mutex);
-        return std::exchange(lines, {});
-    }
+    static void hook(int priority, const char* text) { lines.emplace_back(priority, text); }
+    static std::vector<std::pair<int, std::string>> take() { return std::exchange(lines, {}); }
 };
 struct SleepCapture {
-    static std::vector<unsigned>& requests()
-    {
-        static std::vector<unsigned> r;
-        return r;
-    }
-    static void hook(unsigned ms) { requests().push_back(ms); }
+    static inline std::vector<unsigned> sleeps;
+    static void hook(unsigned ms) { sleeps.push_back(ms); }
 };
