@@ -41,10 +41,7 @@ SLHandle* indication(uint32_t type, const std::string& cls)
 }
 
 std::string seen;
-std::string tagOf(SLHandle* h)
-{
-    return std::to_string(loadWordAt(h->command, 3)) + " ";
-}
+std::string tagOf(SLHandle* h) { return std::to_string(loadWordAt(h->command, 3)) + " "; }
 
 class Events : public ::testing::Test {
 protected:
@@ -61,24 +58,14 @@ protected:
 
 TEST_F(Events, ClassStringChoosesTheMatcher)
 {
-    struct Row {
-        uint32_t type;
-        std::string cls;
-        uint32_t cut; // non-zero: the indication ends this many characters into the string
-        const char* expected;
-    } rows[] = {
-        {1, "zorek|error|Baseboard|001", 0, "vendor0 "},
-        {1, "Zorek|Error", 0, "vendor0 "},
+    // cut: non-zero when the indication ends this many characters into the string.
+    struct Row { uint32_t type; std::string cls; uint32_t cut; const char* expected; } rows[] = {
+        {1, "zorek|error|Baseboard|001", 0, "vendor0 "}, {1, "Zorek|Error", 0, "vendor0 "},
         {1, "Zorek|ErroX|Baseboard", 0, "unknown "}, // all 11 characters count
-        {1, "EVENTGENERATION|Temperature|001", 0, "standard0 "},
-        {1, "EventGeneration|", 0, "standard0 "},
+        {1, "EVENTGENERATION|Temperature|001", 0, "standard0 "}, {1, "EventGeneration|", 0, "standard0 "},
         {1, "EventGenerationX|Temperature", 0, "unknown "}, // the bar counts
-        {1, "Zorek|Error|x", 3, "unknown "},                // what lies past the end is not read
-        {1, "EventGeneration|x", 9, "unknown "},
-        {1, "", 0, ""},
-        {2, "", 0, "installed "},
-        {3, "", 0, ""},
-        {7, "", 0, ""},
+        {1, "Zorek|Error|x", 3, "unknown "}, {1, "EventGeneration|x", 9, "unknown "}, // nothing read past the end
+        {1, "", 0, ""}, {2, "", 0, "installed "}, {3, "", 0, ""}, {7, "", 0, ""},
     };
     for (const Row& row : rows) {
         seen.clear();
@@ -122,20 +109,14 @@ TEST_F(Events, QueueCountsKeepsOrderAndStops)
     SLDestroyHandle(h);
 }
 
-std::vector<std::string> commands;
-std::string logText;
+std::string commands, logText;
 bool inDrive;
 
 TEST(Startup, MarkerCheckOrderAndTexts)
 {
     const std::string checking = "Checking for mox configurations ..\n", go = "Proceeding with loading mox ..\n";
-    struct Row {
-        std::vector<std::string> files; // "f/": on the floppy; "-": no floppy in the drive
-        int result;
-        std::string out, ran;
-    } rows[] = {
-        {{"mox.not", "-"}, 4, "", ""},
-        {{"vornmox.not", "f/mox.not"}, 4, "", ""},
+    struct Row { std::vector<std::string> files; int result; std::string out, ran; } rows[] = { // "f/": floppy
+        {{"mox.not", "-"}, 4, "", ""}, {{"vornmox.not", "f/mox.not"}, 4, "", ""}, // "-": no floppy in the drive
         {{"-"}, 0, checking + "There is no floppy found in floppy drive\n" + go, "mount "},
         {{"f/mox.not", "f/vornmox.not"}, 4, checking + "file mox.not  found in floppy\n", "mount umount "},
         {{"f/vornmox.not"}, 4, checking + "file vornmox.not found in floppy\n", "mount umount "},
@@ -153,20 +134,14 @@ TEST(Startup, MarkerCheckOrderAndTexts)
         char* buffer = nullptr;
         size_t size = 0;
         MarkerCheck check{paths[0].c_str(), paths[1].c_str(), paths[2].c_str(), paths[3].c_str(), "mount", "umount",
-                          [](const char* command) {
-                              commands.emplace_back(command);
-                              return std::string(command) == "mount" && !inDrive ? 32 : 0;
-                          },
+                          [](const char* command) { return commands += command + std::string(" "),
+                                                           std::string(command) == "mount" && !inDrive ? 32 : 0; },
                           open_memstream(&buffer, &size)};
-        commands.clear();
-        logText.clear();
+        commands.clear(), logText.clear();
         EXPECT_EQ(checkForMoxNot(check), row.result) << row.out;
         fclose(check.out);
         EXPECT_EQ(std::string(buffer, size), row.out);
-        std::string ran;
-        for (const auto& c : commands)
-            ran += c + " ";
-        EXPECT_EQ(ran, row.ran) << row.out;
+        EXPECT_EQ(commands, row.ran) << row.out;
         // Every line also at LOG_ERR, the first with a leading line feed.
         EXPECT_EQ(logText, row.out.empty() ? "" : "\n" + row.out);
         free(buffer);

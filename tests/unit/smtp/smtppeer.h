@@ -32,12 +32,7 @@ public:
     }
     ~ScriptedServer() { received(), close(listener_); }
     uint16_t port() const { return port_; }
-    const std::string& received()
-    {
-        if (thread_.joinable())
-            thread_.join();
-        return received_;
-    }
+    const std::string& received() { return thread_.joinable() ? thread_.join(), received_ : received_; }
 
 private:
     // Waits for bytes within a 10-second guard; false at the end of the stream.
@@ -61,8 +56,8 @@ private:
             cursor = found + awaited.size();
             send(fd, reply.data(), reply.size(), MSG_NOSIGNAL);
         }
-        while (fd >= 0 && readSome(fd)) {
-        }
+        while (fd >= 0 && readSome(fd))
+            continue;
         close(fd);
     }
     int listener_ = -1;
