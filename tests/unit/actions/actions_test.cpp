@@ -1,7 +1,6 @@
 #include <gtest/gtest.h>
 
 #include <fstream>
-#include <string>
 #include <sys/wait.h>
 #include <syslog.h>
 #include <unistd.h>

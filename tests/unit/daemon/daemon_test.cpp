@@ -4,12 +4,10 @@
 #include <csignal>
 #include <cstring>
 #include <fstream>
-#include <string>
 #include <sys/stat.h>
 #include <syslog.h>
 #include <thread>
 #include <unistd.h>
-#include <vector>
 
 #include "base/log.h"
 #include "daemon/daemon.h"

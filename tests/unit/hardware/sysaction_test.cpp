@@ -1,8 +1,5 @@
 #include <gtest/gtest.h>
 
-#include <string>
-#include <vector>
-
 #include "base/sleep.h"
 #include "hardware/sysaction.h"
 #include "simdriver.h"

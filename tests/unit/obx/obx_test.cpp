@@ -3,9 +3,6 @@
 #include <cstring>
 #include <fstream>
 #include <functional>
-#include <string>
-#include <tuple>
-#include <vector>
 
 #include "simdriver.h"
 

@@ -5,9 +5,6 @@
 
 #include <gtest/gtest.h>
 
-#include <string>
-#include <vector>
-
 #include "obx/obxapi.h"
 #include "obxdrv/obxsim.h"
 

@@ -2,7 +2,6 @@
 
 #include <numeric>
 #include <optional>
-#include <string>
 #include <syslog.h>
 
 #include "smtp/smtp.h"
@@ -109,20 +108,6 @@ TEST(Smtp, ReplyPiecesAndLineEnds)
         EXPECT_EQ(std::make_pair(length, std::string(out)), std::make_pair(row.length, row.text)) << row.pieces[0];
         writer.join();
         close(ends[0]), close(ends[1]);
-    }
-}
-
-TEST(Smtp, RecipientSplitting)
-{
-    struct Row { const char* list; size_t length; std::string items; } rows[] = {
-        {"a@x,b@y;;c@z", 125, "[a@x][b@y][c@z]"}, {",;;,", 125, ""}, {" a , b", 125, "[ a ][ b]"},
-        {"abc;def", 5, "[abc][d]"}};
-    for (const Row& row : rows) {
-        std::string items;
-        size_t position = 0, start = 0, length = 0;
-        while (smtpNextRecipient(row.list, row.length, &position, &start, &length))
-            items += "[" + std::string(row.list + start, length) + "]";
-        EXPECT_EQ(items, row.items) << row.list;
     }
 }
 
