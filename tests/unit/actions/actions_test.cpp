@@ -76,12 +76,13 @@ TEST_F(SystemActions, CapabilityCodeAndDelayOfEachWrapper)
 TEST(Notify, LogLinesAndPriorities)
 {
     uint32_t key = 42;
-    SLKeyList keys{0, 1, {{1, 5, &key}}, nullptr};
+    SLKeyList keys{0, 1, {{1, 5, &key}}, nullptr}, valueless{0, 1, {{1, 5, nullptr}}, nullptr};
     const std::string standard = "TYPE:Warm COMPONENT:Unknown GROUP:Fan SEVERITY:Unknown ROW:",
                       rest = " SYSTEM:Unknown SUBSYSTEM:Unknown\n";
     struct Row { uint32_t kind, severity; SLKeyList* keys; int priority; std::string line; } rows[] = {
         {EVENT_STANDARD, 1, nullptr, LOG_INFO, standard + "Not Applicable" + rest},
         {EVENT_STANDARD, 2, &keys, LOG_INFO, standard + "42" + rest}, // no row name: the first key
+        {EVENT_STANDARD, 2, &valueless, LOG_INFO, ""}, // a key without a value is never read
         {EVENT_STANDARD, 4, nullptr, LOG_INFO, ""}, {EVENT_STANDARD, 8, nullptr, LOG_WARNING, ""},
         {EVENT_STANDARD, 16, nullptr, LOG_ERR, ""}, {EVENT_STANDARD, 32, nullptr, LOG_ERR, ""},
         {EVENT_UNKNOWN, 1, nullptr, LOG_NOTICE, "DMI Unknown Indication Unknown\n"},

@@ -99,6 +99,7 @@ TEST_F(Events, QueueCountsKeepsOrderAndStops)
         std::this_thread::sleep_for(std::chrono::milliseconds(10));
     EXPECT_EQ(EventsHandled(), before + 6) << "every type is counted";
     EXPECT_EQ(seen, "standard0 vendor1 standard2 vendor3 installed ");
+    EXPECT_EQ(eventsWorkersRunning(), 1) << "the stopped worker must not have joined the new one";
     KillEventThread();
     EventHandler(h);
     EXPECT_EQ(eventsQueued(), 0u);

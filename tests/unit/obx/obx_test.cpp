@@ -121,8 +121,13 @@ TEST_F(Obx, AsyncFetchAndMemoryMapping)
     EXPECT_EQ(std::memcmp(mapped, contents.data() + 0x923, 16), 0);
     EXPECT_EQ(UnmapPhysicalMemory(mapped, 16), ObxResultOk);
     EXPECT_EQ(UnmapPhysicalMemory(mapped, -1), ObxResultError);
+    obxsimSetMemory(path.c_str(), 0xFED00000); // above 2 GiB the file offset stays positive
+    ASSERT_EQ(MapPhysicalMemory(0xFED00010, 16, &mapped), ObxResultOk);
+    EXPECT_EQ(std::memcmp(mapped, contents.data() + 0x10, 16), 0);
+    EXPECT_EQ(UnmapPhysicalMemory(mapped, 16), ObxResultOk);
     EXPECT_EQ(actions(), "async message fetched: sequence 1; async message fetched: sequence 2; async message "
-                         "fetched: sequence 3; mmap physical 0xe0000 length 2355; close /dev/obx; munmap length 2355; ");
+                         "fetched: sequence 3; mmap physical 0xe0000 length 2355; close /dev/obx; munmap length 2355; "
+                         "mmap physical 0xfed00000 length 32; close /dev/obx; munmap length 32; ");
     unlink(path.c_str());
 }
 
