@@ -2,7 +2,7 @@
 // as a scripted server receives it.
 #include "base/sleep.h"
 #include "provider.h"
-#include "scripted_server.h"
+#include "smtppeer.h"
 #include "smtp/email.h"
 #include "smtp/smtp.h"
 
