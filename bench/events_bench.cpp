@@ -49,12 +49,12 @@ void countLine(int, const char* text)
 // A standard-table row of the test board's voltage events (type 4).
 std::string row(int instance, std::initializer_list<int> actions)
 {
-    std::string r = "{ 1, 20, 4, " + std::to_string(instance) + ", 0, 0";
+    std::string r = "1, 20, 4, " + std::to_string(instance) + ", 0, 0";
     for (int id = 7; id <= 22; ++id) {
         bool on = std::find(actions.begin(), actions.end(), id) != actions.end();
         r += id == 17 ? ", \"\"" : on ? ", 1" : ", 0";
     }
-    return r + ", 1, 1, 2 }\n";
+    return r + ", 1, 1, 2";
 }
 
 // The test board with a status display and a paging group.
@@ -133,7 +133,8 @@ int main(int argc, char** argv)
     std::string dir = pattern;
     std::string error;
     if (dmisp::reset(dir + "/db", false, &error) != 0 ||
-        dmisp::installText(ownMif(row(0, {9}) + row(1, {9, 10, 19}), ""), "own.mif", &error) == 0 ||
+        dmisp::installText(ownMif(OwnMif{"2.93", {"1, \"Test Board\""}, {}, {}, {row(0, {9}), row(1, {9, 10, 19})}}),
+                           "own.mif", &error) == 0 ||
         (board = dmisp::installText(boardWithPanel(), "board.mif", &error)) == 0) {
         std::fprintf(stderr, "%s\n", error.c_str());
         return 1;

@@ -2,175 +2,164 @@
 
 #include <chrono>
 #include <csignal>
-#include <cstdlib>
-#include <fcntl.h>
+#include <cstring>
 #include <fstream>
-#include <sstream>
-#include <string>
 #include <sys/stat.h>
-#include <sys/wait.h>
+#include <syslog.h>
 #include <thread>
 #include <unistd.h>
-#include <vector>
 
+#include "base/log.h"
 #include "daemon/daemon.h"
+#include "daemon/events.h"
+#include "daemon/startup.h"
+#include "sl/sl.h"
+#include "sl/slhandle.h"
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
-
-bool running(pid_t pid)
+// An indication as the SL event thread hands it over: header words in the
+// command block, the indication in the confirm buffer, with one class string
+// (none when empty) at offset 1024. Every byte not written is 0x5A, so nothing
+// past the string's end reads as a terminator.
+SLHandle* indication(uint32_t type, const std::string& cls)
 {
-    int status;
-    return waitpid(pid, &status, WNOHANG) == 0;
+    SLHandle* h = SLCreateHandle(0);
+    std::memset(h->command, 0, SL_COMMAND_SIZE);
+    std::memset(h->confirm, 0x5A, h->confirmSize);
+    const uint32_t header[13] = {SL_LEVEL_CHECK, type, 4096, 0, 0, 0, 0, 0, 0, 0, 0, 0, 64};
+    for (uint32_t i = 0; i < 13; ++i)
+        storeWordAt(h->command, i, header[i]);
+    const uint32_t classes[4] = {cls.empty() ? 0u : 1u, 5, 1024, 0}; // count; component, string, rows
+    for (uint32_t i = 0; i < 4; ++i)
+        storeWordAt(h->confirm + 64, i, classes[i]);
+    storeWord(h->confirm + 1024, static_cast<uint32_t>(cls.size()));
+    std::memcpy(h->confirm + 1028, cls.data(), cls.size());
+    return h;
 }
 
-TEST(SignalHandling, CallerSuppliedTerminationSet)
-{
-    pid_t child = fork();
-    if (child == 0) {
-        sigset_t term;
-        sigemptyset(&term);
-        sigaddset(&term, SIGHUP);
-        pthread_t thread;
-        if (daemon_startSignalHandling(nullptr, &term, &thread) != 0)
-            _exit(2);
-        pthread_join(thread, nullptr);
-        _exit(0);
-    }
-    std::this_thread::sleep_for(std::chrono::milliseconds(200));
-    kill(child, SIGTERM);
-    std::this_thread::sleep_for(std::chrono::milliseconds(200));
-    EXPECT_TRUE(running(child)) << "SIGTERM is consumed when the termination set holds only SIGHUP";
-    kill(child, SIGHUP);
-    int status = 0;
-    waitpid(child, &status, 0);
-    ASSERT_TRUE(WIFEXITED(status));
-    EXPECT_EQ(WEXITSTATUS(status), 0);
-}
+std::string seen;
+std::string tagOf(SLHandle* h) { return std::to_string(loadWordAt(h->command, 3)) + " "; }
 
-TEST(SignalHandling, DefaultWaitSetLeavesFourSignalsOut)
-{
-    sigset_t set;
-    ASSERT_EQ(daemon_defaultWaitSet(&set), 0);
-    for (int s : {SIGALRM, SIGIO, SIGUSR1, SIGUSR2})
-        EXPECT_EQ(sigismember(&set, s), 0) << s;
-    for (int s : {SIGHUP, SIGINT, SIGQUIT, SIGTERM, SIGPWR, SIGCHLD, SIGPIPE})
-        EXPECT_EQ(sigismember(&set, s), 1) << s;
-}
-
-TEST(DaemonServices, DescriptorLimitIsCached)
-{
-    resetOpenFileHandlesCache();
-    EXPECT_EQ(maxOpenFileHandlesFrom([](int) -> long { return -1; }), 256);
-    EXPECT_EQ(maxOpenFileHandlesFrom([](int) -> long { return 4096; }), 256) << "cached";
-    resetOpenFileHandlesCache();
-    EXPECT_EQ(maxOpenFileHandlesFrom([](int) -> long { return 1024; }), 1024);
-    resetOpenFileHandlesCache();
-}
-
-// The real daemon in a scratch working directory, with a `mount` on PATH that
-// finds no floppy.
-struct Daemon {
-    pid_t pid = -1;
-    std::string dir;
-    std::string output;
-    Clock::time_point started;
-
-    void start()
+class Events : public ::testing::Test {
+protected:
+    void SetUp() override
     {
-        char pattern[] = "/tmp/moxprocXXXXXX";
-        dir = mkdtemp(pattern);
-        std::string bin = dir + "/bin";
-        mkdir(bin.c_str(), 0755);
-        for (const char* tool : {"mount", "umount"}) {
-            std::string path = bin + "/" + tool;
-            std::ofstream(path) << "#!/bin/sh\nexit 32\n";
-            chmod(path.c_str(), 0755);
-        }
-        mkdir((dir + "/db").c_str(), 0755);
-        output = dir + "/stdout";
-        started = Clock::now();
-        pid = fork();
-        if (pid == 0) {
-            if (chdir(dir.c_str()) != 0)
-                _exit(97);
-            int fd = open(output.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-            dup2(fd, 1);
-            setenv("PATH", (bin + ":/usr/bin:/bin").c_str(), 1);
-            setenv("DMISP_DB", (dir + "/db").c_str(), 1);
-            setenv("UXDMIPATH", MOX_SOURCE_DIR "/mifs", 1);
-            // Default dispositions and an empty mask, as a shell would start it.
-            sigset_t none;
-            sigemptyset(&none);
-            sigprocmask(SIG_SETMASK, &none, nullptr);
-            execl(MOX_BINARY, "mox", static_cast<char*>(nullptr));
-            _exit(98);
-        }
+        SLInitialize();
+        saved_ = eventsSetCallees({[](SLHandle* h) { seen += "standard" + tagOf(h); },
+                                   [](SLHandle* h) { seen += "vendor" + tagOf(h); }, [](SLHandle*) { seen += "unknown "; },
+                                   [](SLHandle*) { seen += "installed "; }});
     }
-    std::string out() const
-    {
-        std::ifstream in(output);
-        std::stringstream s;
-        s << in.rdbuf();
-        return s.str();
-    }
+    void TearDown() override { eventsSetCallees(saved_), SLCleanup(); }
+    EventCallees saved_{};
 };
 
-TEST(DaemonProcess, SignalsEndItOnlyAfterTenSecondsWithStatusZero)
+TEST_F(Events, ClassStringChoosesTheMatcher)
 {
-    const int stops[] = {SIGTERM, SIGINT, SIGQUIT, SIGPWR};
-    std::vector<Daemon> daemons(4);
-    for (auto& d : daemons)
-        d.start();
-    std::this_thread::sleep_for(std::chrono::seconds(2));
-    for (auto& d : daemons) {
-        for (int consumed : {SIGHUP, SIGCHLD, SIGPIPE})
-            kill(d.pid, consumed);
-    }
-    std::this_thread::sleep_for(std::chrono::milliseconds(500));
-    for (size_t i = 0; i < daemons.size(); ++i) {
-        ASSERT_TRUE(running(daemons[i].pid)) << "SIGHUP, SIGCHLD and SIGPIPE are consumed";
-        EXPECT_EQ(daemons[i].out(),
-                  "Checking for mox configurations ..\nThere is no floppy found in floppy drive\n"
-                  "Proceeding with loading mox ..\n")
-            << "lines reach standard output while the daemon runs";
-        kill(daemons[i].pid, stops[i]);
-    }
-    for (size_t i = 0; i < daemons.size(); ++i) {
-        int status = 0;
-        waitpid(daemons[i].pid, &status, 0);
-        auto lived = Clock::now() - daemons[i].started;
-        ASSERT_TRUE(WIFEXITED(status)) << "signal " << stops[i] << " killed it: " << WTERMSIG(status);
-        EXPECT_EQ(WEXITSTATUS(status), 0);
-        EXPECT_GE(lived, std::chrono::milliseconds(9900)) << "not before the initial thread's 10 s";
+    // cut: non-zero when the indication ends this many characters into the string.
+    struct Row { uint32_t type; std::string cls; uint32_t cut; const char* expected; } rows[] = {
+        {1, "zorek|error|Baseboard|001", 0, "vendor0 "}, {1, "Zorek|Error", 0, "vendor0 "},
+        {1, "Zorek|ErroX|Baseboard", 0, "unknown "}, // all 11 characters count
+        {1, "EVENTGENERATION|Temperature|001", 0, "standard0 "}, {1, "EventGeneration|", 0, "standard0 "},
+        {1, "EventGenerationX|Temperature", 0, "unknown "}, // the bar counts
+        {1, "Zorek|Error|x", 3, "unknown "}, {1, "EventGeneration|x", 9, "unknown "}, // nothing read past the end
+        {1, "", 0, ""}, {2, "", 0, "installed "}, {3, "", 0, ""}, {7, "", 0, ""},
+    };
+    for (const Row& row : rows) {
+        seen.clear();
+        SLHandle* h = indication(row.type, row.cls);
+        if (row.cut != 0) { // the string's length word agrees; its bytes go on
+            storeWordAt(h->command, 2, 1028 + row.cut);
+            storeWord(h->confirm + 1024, row.cut);
+        }
+        processEvent(h);
+        SLDestroyHandle(h);
+        EXPECT_EQ(seen, row.expected) << row.type << " " << row.cls << " " << row.cut;
     }
 }
 
-TEST(DaemonProcess, MarkerFileDisables)
+TEST_F(Events, QueueCountsKeepsOrderAndStops)
 {
-    Daemon d;
-    char pattern[] = "/tmp/moxprocXXXXXX";
-    std::string dir = mkdtemp(pattern);
-    std::ofstream(dir + "/mox.not") << "";
-    pid_t pid = fork();
-    std::string output = dir + "/stdout";
-    if (pid == 0) {
-        if (chdir(dir.c_str()) != 0)
-            _exit(97);
-        int fd = open(output.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-        dup2(fd, 1);
-        execl(MOX_BINARY, "mox", static_cast<char*>(nullptr));
-        _exit(98);
+    unsigned before = EventsHandled();
+    SLHandle* h = indication(1, "EventGeneration|");
+    EventHandler(h); // no worker yet: dropped
+    EXPECT_EQ(eventsQueued(), 0u);
+    // A worker stopped before its first step is still waited for.
+    ASSERT_EQ(CreateEventHandler(), 0);
+    KillEventThread();
+    EXPECT_EQ(eventsWorkersRunning(), 0);
+    ASSERT_EQ(CreateEventHandler(), 0);
+    for (uint32_t i = 0; i < 6; ++i) {
+        storeWordAt(h->command, 1, i < 4 ? 1 : i == 4 ? 2 : 7);
+        storeWordAt(h->command, 3, i);
+        std::memcpy(h->confirm + 1028, i % 2 ? "Zorek|Error|abcd" : "EventGeneration|", 16);
+        EventHandler(h);
     }
-    int status = 0;
-    waitpid(pid, &status, 0);
-    ASSERT_TRUE(WIFEXITED(status));
-    EXPECT_EQ(WEXITSTATUS(status), 0);
-    std::ifstream in(output);
-    std::string line;
-    std::getline(in, line);
-    EXPECT_EQ(line, "Mox has been disabled.");
+    for (int i = 0; i < 2000 && EventsHandled() < before + 6; ++i)
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    EXPECT_EQ(EventsHandled(), before + 6) << "every type is counted";
+    EXPECT_EQ(seen, "standard0 vendor1 standard2 vendor3 installed ");
+    EXPECT_EQ(eventsWorkersRunning(), 1) << "the stopped worker must not have joined the new one";
+    KillEventThread();
+    EventHandler(h);
+    EXPECT_EQ(eventsQueued(), 0u);
+    DestroyEventHandler();
+    EXPECT_EQ(EventsHandled(), before + 6);
+    SLDestroyHandle(h);
+}
+
+std::string commands, logText;
+bool inDrive;
+
+TEST(Startup, MarkerCheckOrderAndTexts)
+{
+    const std::string checking = "Checking for mox configurations ..\n", go = "Proceeding with loading mox ..\n";
+    struct Row { std::vector<std::string> files; int result; std::string out, ran; } rows[] = { // "f/": floppy
+        {{"mox.not", "-"}, 4, "", ""}, {{"vornmox.not", "f/mox.not"}, 4, "", ""}, // "-": no floppy in the drive
+        {{"-"}, 0, checking + "There is no floppy found in floppy drive\n" + go, "mount "},
+        {{"f/mox.not", "f/vornmox.not"}, 4, checking + "file mox.not  found in floppy\n", "mount umount "},
+        {{"f/vornmox.not"}, 4, checking + "file vornmox.not found in floppy\n", "mount umount "},
+        {{}, 0, checking + "Couldn't find any mox configuration files in floppy drive\n" + go, "mount umount "},
+    };
+    moxSetLogHook([](int priority, const char* text) { logText += (priority == LOG_ERR ? "" : "!") + std::string(text); });
+    for (const Row& row : rows) {
+        char pattern[] = "/tmp/moxmarkXXXXXX";
+        const std::string dir = std::string(mkdtemp(pattern)) + "/";
+        mkdir((dir + "f").c_str(), 0755);
+        inDrive = true;
+        for (const auto& f : row.files)
+            f == "-" ? void(inDrive = false) : void(std::ofstream(dir + f) << "");
+        const std::string paths[4] = {dir + "vornmox.not", dir + "mox.not", dir + "f/mox.not", dir + "f/vornmox.not"};
+        char* buffer = nullptr;
+        size_t size = 0;
+        MarkerCheck check{paths[0].c_str(), paths[1].c_str(), paths[2].c_str(), paths[3].c_str(), "mount", "umount",
+                          [](const char* command) { return commands += command + std::string(" "),
+                                                           std::string(command) == "mount" && !inDrive ? 32 : 0; },
+                          open_memstream(&buffer, &size)};
+        commands.clear(), logText.clear();
+        EXPECT_EQ(checkForMoxNot(check), row.result) << row.out;
+        fclose(check.out);
+        EXPECT_EQ(std::string(buffer, size), row.out);
+        EXPECT_EQ(commands, row.ran) << row.out;
+        // Every line also at LOG_ERR, the first with a leading line feed.
+        EXPECT_EQ(logText, row.out.empty() ? "" : "\n" + row.out);
+        free(buffer);
+    }
+    moxSetLogHook(nullptr);
+}
+
+TEST(Startup, DefaultSignalSets)
+{
+    // Run last: from here on this thread blocks the wait set, and the signal
+    // thread takes what reaches the process.
+    pthread_t thread;
+    ASSERT_EQ(daemon_startSignalHandling(nullptr, nullptr, &thread), 0);
+    auto* sets = static_cast<const sigset_t*>(daemon_signalParam()); // wait, then stop
+    std::string text;
+    for (int s : {SIGTERM, SIGINT, SIGQUIT, SIGPWR, SIGHUP, SIGCHLD, SIGPIPE, SIGALRM, SIGIO, SIGUSR1, SIGUSR2})
+        text += std::to_string(sigismember(&sets[0], s)) + std::to_string(sigismember(&sets[1], s)) + " ";
+    // Waited for: all but ALRM, IO, USR1, USR2. Stopping: TERM, INT, QUIT, PWR.
+    EXPECT_EQ(text, "11 11 11 11 10 10 10 00 00 00 00 ");
 }
 
 } // namespace

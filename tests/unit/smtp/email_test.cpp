@@ -1,134 +1,65 @@
-#include <gtest/gtest.h>
-
-#include <cstdlib>
-#include <string>
-#include <syslog.h>
-
-#include "dmisp/dmisp.h"
-#include "mif/mif.h"
-#include "daemon/events.h"
-#include "hardware/lcd.h"
-#include "hardware/sysctrl.h"
-#include "scripted_server.h"
-#include "sl/sl.h"
+// Composition of the alert from the baseboard's e-mail settings (provider)
+// as a scripted server receives it.
+#include "base/sleep.h"
+#include "provider.h"
+#include "smtppeer.h"
 #include "smtp/email.h"
-#include "smtp_test_support.h"
+#include "smtp/smtp.h"
 
 namespace {
 
-constexpr uint32_t emailGroup = 1012;
+class Email : public Provider {};
 
-// The daemon registered with a provider holding the shipped baseboard, whose
-// e-mail settings group starts empty.
-class EmailComposition : public ::testing::Test {
-protected:
-    void SetUp() override
-    {
-        char pattern[] = "/tmp/moxemailXXXXXX";
-        std::string dir = mkdtemp(pattern);
-        std::string error;
-        ASSERT_EQ(dmisp::reset(dir + "/db", false, &error), 0) << error;
-        board_ = dmisp::install(MOX_SOURCE_DIR "/mifs/baseboard.mif", &error);
-        ASSERT_NE(board_, 0u) << error;
-        setenv("UXDMIPATH", MOX_SOURCE_DIR "/mifs", 1);
-        SLInitialize();
-        RegisterWithSLCalls(RegistrationCalls{EventHandler, [] { SysCtrlInitialize(); LcdInitialize(); }});
-        ASSERT_EQ(RegisterWithSL(), 0);
-        ASSERT_EQ(BaseboardComponentId(), board_);
-        ASSERT_EQ(moxHostName(host_), 0);
-        smtpSetLimitMs(300); // the silent subject stage
-        moxSetSleepHook(SleepCapture::hook);
-        moxSetLogHook(LogCapture::hook);
-        LogCapture::take();
-    }
-    void TearDown() override
-    {
-        moxSetLogHook(nullptr);
-        moxSetSleepHook(nullptr);
-        smtpSetLimitMs(8000);
-        smtpSetPort(25);
-        UnregisterWithSL();
-        SLCleanup();
-        dmisp::shutdown();
-    }
-    void set(uint32_t attribute, const std::string& value)
-    {
-        ASSERT_EQ(dmisp::setValue(board_, emailGroup, attribute, {}, value), 0u);
-    }
-    // Sends the alert of `record` to a server that accepts it; what it received.
-    std::string send(EventRecord* record, int recipients)
-    {
-        ScriptedServer peer(acceptingScript(recipients));
+TEST_F(Email, FromTheBaseboardSettingsAsTheServerReceivesIt)
+{
+    uint32_t board = install("baseboard.mif", true);
+    manage();
+    catalogue(board, 1);
+    char host[MOX_HOST_NAME_SIZE] = {};
+    ASSERT_EQ(moxHostName(host), 0);
+    const std::string admin = std::string("admin@") + host, subject = std::string("Alert:") + host + "\r\nCheck ",
+                      tail = std::string(" at server ") + host + "\r\nEvent Type:";
+    const std::string end = "\r\nEvent Severity:Critical\r\nComponent:Zorek Tessarin Baseboard\r\nGroup:";
+    smtpSetLimitMs(300); // the server says nothing after the subject line
+    moxSetSleepHook([](unsigned) {});
+    struct Row { const char* sender; const char* recipients; const char* group; const char* type; int count; std::string expected; } rows[] = {
+        {nullptr, nullptr, "Voltage Probe", "Upper Critical", 1,
+         "MAIL FROM:<" + admin + ">\r\nRCPT TO:<" + admin + ">\r\nDATA\r\nSUBJECT:Zorek Server Management " + subject +
+             "Voltage Probe" + tail + "Upper Critical" + end + "Voltage Probe"},
+        {"ops\xe9@example.org", "a@example.org;b@example.org", "Fan\r\nRSET", nullptr, 2,
+         "MAIL FROM:<ops @example.org>\r\nRCPT TO:<a@example.org>\r\nRCPT TO:<b@example.org>\r\nDATA\r\n"
+         "SUBJECT:Zorek Server Management " + subject + "Fan  RSET" + tail + "Unknown" + end + "Fan  RSET"}};
+    ASSERT_EQ(dmisp::setValue(board, 1012, 1, {}, "127.0.0.1"), 0u);
+    for (const auto& r : rows) {
+        SCOPED_TRACE(r.group);
+        if (r.sender != nullptr) {
+            dmisp::setValue(board, 1012, 2, {}, r.sender);
+            dmisp::setValue(board, 1012, 3, {}, r.recipients);
+        }
+        EventRecord record{};
+        record.eventKind = EVENT_STANDARD;
+        record.componentName = "Zorek Tessarin Baseboard";
+        record.groupName = r.group;
+        record.eventTypeText = r.type;
+        record.severityText = "Critical";
+        ScriptedServer peer(acceptingScript(r.count));
         smtpSetPort(peer.port());
         testing::internal::CaptureStderr();
-        MoxSendEmail(nullptr, record);
+        MoxSendEmail(nullptr, &record);
         testing::internal::GetCapturedStderr();
+        EXPECT_EQ(peer.received(), "HELO 127.0.0.1\r\n" + r.expected + "\r\nInstance:Unknown\r\n.\r\nQUIT\r\n");
         EXPECT_EQ(pEmailConfig, nullptr);
-        return peer.received();
+        EXPECT_TRUE(lines().empty()) << "a delivered alert logs nothing";
     }
-
-    uint32_t board_ = 0;
-    char host_[MOX_HOST_NAME_SIZE] = {};
-};
-
-EventRecord voltageRecord()
-{
+    // Without a server address nothing is sent or logged.
+    dmisp::setValue(board, 1012, 1, {}, "");
+    smtpSetPort(1);
     EventRecord record{};
-    record.eventKind = EVENT_STANDARD;
-    record.componentName = "Zorek Tessarin Baseboard";
-    record.groupName = "Voltage Probe";
-    record.eventTypeText = "Upper Critical";
-    record.severityText = "Critical";
-    return record;
-}
-
-TEST_F(EmailComposition, NoServerSendsNothingAndLogsNothing)
-{
-    smtpSetPort(1); // nobody listens: a connection would be logged as step 3
-    EventRecord record = voltageRecord();
-    testing::internal::CaptureStderr();
     MoxSendEmail(nullptr, &record);
-    EXPECT_EQ(testing::internal::GetCapturedStderr(), "");
-    EXPECT_TRUE(LogCapture::take().empty());
-    EXPECT_EQ(pEmailConfig, nullptr);
-}
-
-TEST_F(EmailComposition, DefaultAddressesSubjectAndBody)
-{
-    set(1, "127.0.0.1");
-    EventRecord record = voltageRecord();
-    std::string admin = std::string("admin@") + host_;
-    std::string got = send(&record, 1);
-    EXPECT_EQ(got, "HELO 127.0.0.1\r\n"
-                   "MAIL FROM:<" + admin + ">\r\n"
-                   "RCPT TO:<" + admin + ">\r\n"
-                   "DATA\r\n"
-                   "SUBJECT:Zorek Server Management Alert:" + host_ + "\r\n"
-                   "Check Voltage Probe at server " + host_ + "\r\n"
-                   "Event Type:Upper Critical\r\n"
-                   "Event Severity:Critical\r\n"
-                   "Component:Zorek Tessarin Baseboard\r\n"
-                   "Group:Voltage Probe\r\n"
-                   "Instance:Unknown\r\n"
-                   ".\r\n"
-                   "QUIT\r\n");
-    EXPECT_TRUE(LogCapture::take().empty()) << "a delivered alert logs nothing";
-}
-
-TEST_F(EmailComposition, SettingsAndDmiTextsNeverInjectCommands)
-{
-    set(1, "127.0.0.1");
-    set(2, "ops\xe9@example.org");
-    set(3, "a@example.org;b@example.org");
-    EventRecord record = voltageRecord();
-    record.groupName = "Fan\r\nRSET";
-    record.eventTypeText = nullptr;
-    std::string got = send(&record, 2);
-    EXPECT_NE(got.find("MAIL FROM:<ops @example.org>\r\n"), std::string::npos) << got;
-    EXPECT_NE(got.find("RCPT TO:<a@example.org>\r\nRCPT TO:<b@example.org>\r\n"), std::string::npos) << got;
-    EXPECT_NE(got.find("Check Fan  RSET at server "), std::string::npos) << got;
-    EXPECT_NE(got.find("Event Type:Unknown\r\n"), std::string::npos) << got;
-    EXPECT_EQ(got.find("\r\nRSET"), std::string::npos) << "a DMI text became a command";
+    EXPECT_TRUE(lines().empty());
+    smtpSetPort(25);
+    smtpSetLimitMs(8000);
+    moxSetSleepHook(nullptr);
 }
 
 } // namespace
