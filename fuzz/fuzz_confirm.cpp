@@ -15,18 +15,7 @@
 
 namespace {
 
-constexpr size_t headerBytes = 68;
-
 volatile uint32_t sink;
-
-void readAll(const void* p, size_t n)
-{
-    const auto* bytes = static_cast<const unsigned char*>(p);
-    uint32_t sum = 0;
-    for (size_t i = 0; i < n; ++i)
-        sum += bytes[i];
-    sink = sum;
-}
 
 void inside(SLHandle* h, const void* p, size_t n)
 {
@@ -36,53 +25,40 @@ void inside(SLHandle* h, const void* p, size_t n)
     auto* at = static_cast<const unsigned char*>(p);
     if (at < begin || n > h->confirmSize || at - begin > static_cast<ptrdiff_t>(h->confirmSize - n))
         abort(); // an address outside the confirm buffer
-    readAll(p, n);
+    for (size_t i = 0; i < n; ++i)
+        sink = sink + at[i];
 }
 
 void string(SLHandle* h, const DmiString* s)
 {
-    if (s == nullptr)
-        return;
-    inside(h, s, 4);
-    inside(h, s, 4 + static_cast<size_t>(dmiStringLength(s)));
-    char* copy = NewCString(s);
-    if (copy != nullptr && strlen(copy) > dmiStringLength(s))
-        abort();
-    SLDeleteString(copy);
-}
-
-void value(SLHandle* h, const void* p)
-{
-    inside(h, p, 4);
+    if (s != nullptr) {
+        inside(h, s, 4);
+        inside(h, s, 4 + static_cast<size_t>(dmiStringLength(s)));
+    }
 }
 
 void walk(SLHandle* h)
 {
     const uint32_t indices[] = {0, 1, 2, 7, 255, 0x10000, 0x7FFFFFFF, 0xFFFFFFFF};
-    sink = SLCnfCount(h) + SLCnfStatus(h) + SLIndicationType(h) + SLIndicationComponentId(h);
-    sink = SLInstallComponentId(h) + SLRegisterHandle(h) + SLComponentId(h) + SLComponentMatchType(h);
-    sink = SLComponentGroupCount(h) + SLComponentFileCount(h) + SLUnsignedValue(h) + SLIntegerValue(h);
-    string(h, SLDmiSpecificationLevel(h));
-    string(h, SLImplementationDescription(h));
-    string(h, SLComponentName(h));
-    string(h, SLDescription(h));
-    string(h, SLStringPtr(h));
-    value(h, SLAttributePtr(h));
-    sink = SLEventClassCount(h);
+    sink = SLCnfCount(h) + SLCnfStatus(h) + SLIndicationType(h) + SLIndicationComponentId(h) +
+           SLInstallComponentId(h) + SLRegisterHandle(h) + SLComponentId(h) + SLComponentMatchType(h) +
+           SLComponentGroupCount(h) + SLComponentFileCount(h) + SLUnsignedValue(h) + SLIntegerValue(h) +
+           SLEventClassCount(h);
+    for (const DmiString* s : {SLDmiSpecificationLevel(h), SLImplementationDescription(h), SLComponentName(h),
+                               SLDescription(h), SLStringPtr(h)})
+        string(h, s);
+    inside(h, SLAttributePtr(h), 4);
     for (uint32_t i : indices) {
-        sink = SLComponentGroupId(h, i) + SLComponentFileType(h, i) + SLGroupId(h, i) + SLAttributeId(h, i);
-        sink = SLAttributeAccess(h, i) + SLAttributeType(h, i) + SLAttributeMaxSize(h, i) +
+        sink = SLComponentGroupId(h, i) + SLComponentFileType(h, i) + SLGroupId(h, i) + SLAttributeId(h, i) +
+               SLAttributeAccess(h, i) + SLAttributeType(h, i) + SLAttributeMaxSize(h, i) +
                SLEnumerationListCount(h, i) + SLEventComponentId(h, i) + SLEventRowCount(h, i);
-        string(h, SLComponentGroupName(h, i));
+        for (const DmiString* s : {SLComponentGroupName(h, i), SLGroupName(h, i), SLGroupClassName(h, i),
+                                   SLAttributeName(h, i), SLEventClassString(h, i), SLEnumerationName(h, i, 0),
+                                   SLEnumerationName(h, i, 1), SLEnumerationName(h, i, 0xFFFFFFFF)})
+            string(h, s);
         inside(h, SLComponentFileData(h, i), 1); // data of unknown length: its first byte
-        string(h, SLGroupName(h, i));
-        string(h, SLGroupClassName(h, i));
-        string(h, SLAttributeName(h, i));
-        string(h, SLEventClassString(h, i));
-        for (uint32_t j : {0u, 1u, 0xFFFFFFFFu}) {
-            sink = static_cast<uint32_t>(SLEnumerationValue(h, i, j));
-            string(h, SLEnumerationName(h, i, j));
-        }
+        sink = static_cast<uint32_t>(SLEnumerationValue(h, i, 0)) +
+               static_cast<uint32_t>(SLEnumerationValue(h, i, 0xFFFFFFFF));
     }
     // Rows: of the confirm itself, or of each selected event class and row.
     for (uint32_t c : {0u, 1u, 3u}) {
@@ -91,31 +67,25 @@ void walk(SLHandle* h)
                 SLEventSelectRowCnf(h, c, r);
             sink = SLRowGroupId(h) + SLRowAttributeCount(h);
             for (uint32_t i : indices) {
-                sink = SLRowAttributeId(h, i) + SLRowAttributeType(h, i) + SLRowUnsignedValue(h, i);
-                sink = static_cast<uint32_t>(SLRowIntegerValue(h, i));
-                value(h, SLRowAttributePtr(h, i));
+                sink = SLRowAttributeId(h, i) + SLRowAttributeType(h, i) + SLRowUnsignedValue(h, i) +
+                       static_cast<uint32_t>(SLRowIntegerValue(h, i));
+                inside(h, SLRowAttributePtr(h, i), 4);
                 string(h, SLRowStringPtr(h, i));
             }
-            SLKeyList* keys = SLCreateKeyList(h);
-            SLDeleteKeyList(keys);
+            SLDeleteKeyList(SLCreateKeyList(h));
             if (SLIndicationType(h) != 1)
                 return;
         }
     }
 }
 
-int initialise()
-{
-    SLInitialize();
-    return 0;
-}
-
 } // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
 {
-    static int once = initialise();
+    static int once = (SLInitialize(), 0);
     (void)once;
+    constexpr size_t headerBytes = 68;
     if (size < headerBytes)
         return 0;
     // The confirm buffer is exactly as long as the data (at least the minimum).

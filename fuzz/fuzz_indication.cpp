@@ -1,13 +1,11 @@
 // Indications from a hostile provider: the bytes are one indication as the
-// provider would deliver it (its length word and completion callback are set
-// to the truth). It goes through SLIndicationFunc onto an SL event thread and
-// into the worker's classification and both matchers' record building, with
-// the real matchers and a provider that refuses every command, so every
-// catalogue and actions-table lookup fails and only the indication is read.
+// provider would deliver it (its length word and completion callback set to
+// the truth). It goes through SLIndicationFunc onto an SL event thread, into
+// the worker's classification and both matchers' record building, with a
+// provider that refuses every command, so only the indication is read.
 #include <atomic>
 #include <cstdint>
 #include <cstdlib>
-#include <cstring>
 #include <sched.h>
 #include <vector>
 
@@ -23,44 +21,31 @@ namespace {
 
 std::atomic<int> completed{0};
 
-uint32_t refuse(void*)
-{
-    return 1;
-}
-
 void complete(void*)
 {
     completed.store(1);
 }
 
-int handler(SLHandle* h)
-{
-    processEvent(h);
-    return 0;
-}
-
-// The own component (id 100) and three supported components with MIF ids 1
+// The own component (id 100) and supported components 1 to 3 with MIF ids 1
 // (the baseboard), 2 and 5; component ids 1 to 3 are in every seed.
-void buildCatalogue()
+int buildCatalogue()
 {
     deleteComponentList(componentList);
     componentList = newComponentInfo(100);
-    for (uint32_t id : {1u, 2u, 3u}) {
-        ComponentInfo* c = appendToList(componentList, id, id == 3 ? 5 : id);
-        if (c != nullptr)
+    for (uint32_t id : {1u, 2u, 3u})
+        if (ComponentInfo* c = appendToList(componentList, id, id == 3 ? 5 : id))
             c->standardEvents = 1;
-    }
+    return 0;
 }
 
 int initialise()
 {
     SLInitialize();
-    SLDmiInvoke = refuse;
+    SLDmiInvoke = [](void*) -> uint32_t { return 1; };
     moxSetLogHook([](int, const char*) {});
     moxSetSleepHook([](unsigned) {});
-    SLEventSetHandler(handler);
-    buildCatalogue();
-    return 0;
+    SLEventSetHandler([](SLHandle* h) { return processEvent(h), 0; });
+    return buildCatalogue();
 }
 
 } // namespace
@@ -71,8 +56,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
     (void)once;
     if (size < 52 || size > 64 * 1024)
         return 0;
-    // The provider's own buffer, exactly as long as the indication.
-    std::vector<uint8_t> indication(data, data + size);
+    std::vector<uint8_t> indication(data, data + size); // exactly as long as the indication
     storeWordAt(indication.data(), 2, static_cast<uint32_t>(size));
     storeWordAt(indication.data(), 11, pointerWord(reinterpret_cast<void*>(&complete)));
     completed.store(0);
@@ -82,7 +66,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
         sched_yield();
     if (EventsHandled() != before + 1)
         abort(); // every delivered indication is classified exactly once
-    // An installed component may have grown the catalogue.
-    buildCatalogue();
+    buildCatalogue(); // an installed component may have grown it
     return 0;
 }

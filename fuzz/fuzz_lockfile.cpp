@@ -1,12 +1,13 @@
 // The alarm daemon's lock file, any bytes, against a private directory that
-// stands in for /proc: process 4242 is "kobd" (a regular file stands in for
-// the FIFO), process 4343 is another program, every other id is no process.
-// The hand-off must send a record only for the peer, remove the files only
-// for a stale lock, and never touch anything outside its paths.
+// stands in for /proc: process 4242 is "kobd", 4343 another program, every
+// other id no process. The FIFO is a real one with a reader kept open here.
+// A lock naming the peer gets one 28-byte record; nothing outside the paths
+// is touched.
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <fcntl.h>
 #include <string>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -16,21 +17,14 @@
 
 namespace {
 
-std::string dir, lock, fifo, cmdline;
+std::string dir, lock, fifo;
+int reader = -1;
 
 void writeFile(const std::string& p, const void* data, size_t size)
 {
     FILE* f = fopen(p.c_str(), "wb");
-    if (f == nullptr)
+    if (f == nullptr || fwrite(data, 1, size, f) != size || fclose(f) != 0)
         abort();
-    fwrite(data, 1, size, f);
-    fclose(f);
-}
-
-bool exists(const std::string& p)
-{
-    struct stat st;
-    return stat(p.c_str(), &st) == 0;
 }
 
 int initialise()
@@ -41,23 +35,19 @@ int initialise()
     dir = pattern;
     lock = dir + "/lock";
     fifo = dir + "/fifo";
-    cmdline = dir + "/%s";
     writeFile(dir + "/4242", "kobd\0-f\0", 8);
     writeFile(dir + "/4343", "kobdx\0", 6);
     moxSetLogHook([](int, const char*) {});
     return 0;
 }
 
-// The first whitespace-separated word of the lock, as fscanf "%19s" reads it.
-std::string firstWord(const uint8_t* data, size_t size)
+// A lock whose first word is this id (blanks before, a blank or the end after).
+bool names(const uint8_t* data, size_t size, const char* id)
 {
-    size_t at = 0;
-    while (at < size && strchr(" \t\n\v\f\r", data[at]) != nullptr && data[at] != '\0')
-        ++at;
-    std::string word;
-    while (at < size && word.size() < 19 && (data[at] == '\0' || strchr(" \t\n\v\f\r", data[at]) == nullptr))
-        word += static_cast<char>(data[at++]);
-    return word;
+    std::string text(reinterpret_cast<const char*>(data), size);
+    size_t at = text.find_first_not_of(" \t\n");
+    return at != std::string::npos && text.compare(at, 4, id) == 0 &&
+           (at + 4 == size || strchr(" \t\n", text[at + 4]) != nullptr);
 }
 
 } // namespace
@@ -68,8 +58,15 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
     (void)once;
     if (size > 256)
         return 0;
+    struct stat st;
+    if (stat(fifo.c_str(), &st) != 0 || !S_ISFIFO(st.st_mode)) {
+        // A stale lock takes the FIFO with it: a new one and a new reader.
+        if (reader >= 0)
+            close(reader);
+        if (mkfifo(fifo.c_str(), 0600) != 0 || (reader = open(fifo.c_str(), O_RDONLY | O_NONBLOCK)) < 0)
+            abort();
+    }
     writeFile(lock, data, size);
-    writeFile(fifo, "", 0);
     SLKeyList keys{};
     uint32_t instance = 7;
     keys.count = 1;
@@ -79,24 +76,16 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
     record.groupId = 5;
     record.keyList = &keys;
     record.groupName = "Power Unit";
-    KobPaths paths{lock.c_str(), fifo.c_str(), cmdline.c_str(), 10};
-    int written = kobProcessAlarmAt(paths, &record);
-
-    // The C string ends at a NUL inside the word.
-    std::string word = firstWord(data, size);
-    word = word.substr(0, word.find('\0'));
-    bool peer = word == "4242";
-    bool stale = word == "4343" || word.empty() || word.find_first_not_of("0123456789") != std::string::npos;
-    if (peer) {
-        struct stat st;
-        if (written != 28 || stat(fifo.c_str(), &st) != 0 || st.st_size != 28 || !exists(lock))
-            abort();
-    } else if (written != 0) {
-        abort();
-    }
-    if (stale == exists(lock) && !peer)
-        abort(); // a stale lock is removed, any other is left alone
-    if (!exists(dir + "/4242") || !exists(dir + "/4343"))
+    int written = kobProcessAlarmAt(KobPaths{lock.c_str(), fifo.c_str(), (dir + "/%s").c_str(), 10}, &record);
+    char got[64];
+    ssize_t n = read(reader, got, sizeof got);
+    if (written != (n < 0 ? 0 : n) || (written != 0 && written != 28))
+        abort(); // what was reported is what the reader received, one record
+    if (names(data, size, "4242") && (written != 28 || stat(lock.c_str(), &st) != 0))
+        abort(); // the peer gets its record and keeps its lock
+    if (names(data, size, "4343") && stat(lock.c_str(), &st) == 0)
+        abort(); // a lock left by another program is stale
+    if (stat((dir + "/4242").c_str(), &st) != 0 || stat((dir + "/4343").c_str(), &st) != 0)
         abort();
     return 0;
 }
