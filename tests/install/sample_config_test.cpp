@@ -1,15 +1,13 @@
 // The shipped sample configuration read by the daemon's own reader: as shipped
 // it changes nothing; each commented "#option = true" line, uncommented, turns
 // its option on (and with "false" off) and leaves the other options alone.
+#include "actions/actionlog.h"
 #include "actions/uxaction.h"
 
 #include <gtest/gtest.h>
 
 #include <fstream>
 #include <regex>
-
-// Options the reader may know; weak, so a flag this build lacks reads as absent.
-extern uint32_t bActionLog __attribute__((weak));
 
 TEST(SampleConfig, AsShippedNothingUncommentedTurnsItsOptionOn)
 {
