@@ -1,79 +1,91 @@
-// A scripted DMI provider for the SL tests: it records every command block it
-// receives and answers each one as the script says, completing it from a
-// thread of its own as a real provider does.
+// An in-process DMI provider for the SL tests: it keeps a copy of every
+// command block it is handed and answers as the script says, confirming
+// before DmiInvoke returns (the library must cope with either order).
 #pragma once
 
-#include <cstdint>
+#include <atomic>
 #include <cstring>
+#include <deque>
 #include <functional>
-#include <mutex>
 #include <string>
-#include <thread>
+#include <utility>
 #include <vector>
 
-#include "sl/sltypes.h"
+#include "base/sleep.h"
+#include "sl/sl.h"
 
-namespace sltest {
-
-// The answer to one command.
 struct Reply {
-    uint32_t invokeResult = 0; // what DmiInvoke returns: 0 accepted, 529 busy, else refused
-    uint32_t status = 0;       // confirm status (word 11)
-    uint32_t count = 1;        // confirm entry count (word 10)
-    bool confirm = true;       // call the confirm callback (commands other than 1024 to 1027)
-    // Writes the confirm buffer; gets its address and size from words 8 and 7.
-    std::function<void(uint8_t* confirm, uint32_t size)> fill;
+    Reply(uint32_t i = 0, uint32_t s = 0, bool c = true, std::function<void(uint8_t*)> f = nullptr)
+        : invoke(i), status(s), confirm(c), fill(std::move(f)) {}
+    uint32_t invoke;  // what DmiInvoke returns: 0 accepted, 529 busy, else refused
+    uint32_t status;  // confirm status (word 11)
+    bool confirm;     // false: accepted and never confirmed
+    std::function<void(uint8_t* confirm)> fill;
 };
 
-// Writes records into a confirm buffer.
-struct ConfirmWriter {
-    uint8_t* base;
-    uint32_t size;
-    void word(uint32_t offset, uint32_t value) const { storeWord(base + offset, value); }
-    uint32_t string(uint32_t offset, const std::string& text) const
+// Writes a DMI string at `offset`; returns the offset behind it.
+inline uint32_t putString(uint8_t* base, uint32_t offset, const std::string& text)
+{
+    storeWord(base + offset, static_cast<uint32_t>(text.size()));
+    std::memcpy(base + offset + 4, text.data(), text.size());
+    return offset + 4 + static_cast<uint32_t>(text.size());
+}
+
+struct ScriptedProvider {
+    std::deque<Reply> queue;                          // used first, in order
+    std::function<Reply(const uint8_t*)> responder;   // then this; else accept
+    std::vector<std::vector<uint8_t>> blocks;
+    std::atomic<int> received{0};
+    std::vector<unsigned> sleeps;
+    bool cleaned = false;
+
+    ScriptedProvider()
     {
-        word(offset, static_cast<uint32_t>(text.size()));
-        std::memcpy(base + offset + 4, text.data(), text.size());
-        return offset + 4 + static_cast<uint32_t>(text.size());
+        current() = this;
+        moxSetSleepHook([](unsigned ms) { current()->sleeps.push_back(ms); });
+        SLInitialize();
+        SLDmiInvoke = &invoke;
+    }
+    ~ScriptedProvider()
+    {
+        cleanup();
+        SLInitialize(); // leave the library usable, with no provider
+        SLDmiInvoke = nullptr;
+        moxSetSleepHook(nullptr);
+        current() = nullptr;
+    }
+    void cleanup()
+    {
+        if (!cleaned)
+            SLCleanup();
+        cleaned = true;
+    }
+    uint32_t word(size_t block, uint32_t index) const { return loadWordAt(blocks.at(block).data(), index); }
+    static ScriptedProvider*& current()
+    {
+        static ScriptedProvider* provider = nullptr;
+        return provider;
+    }
+    static uint32_t invoke(void* commandBlock)
+    {
+        ScriptedProvider& p = *current();
+        auto* block = static_cast<uint8_t*>(commandBlock);
+        p.blocks.emplace_back(block, block + SL_COMMAND_SIZE);
+        ++p.received;
+        Reply reply;
+        if (!p.queue.empty()) {
+            reply = p.queue.front();
+            p.queue.pop_front();
+        } else if (p.responder) {
+            reply = p.responder(block);
+        }
+        if (reply.invoke != 0 || !reply.confirm)
+            return reply.invoke;
+        if (reply.fill)
+            reply.fill(static_cast<uint8_t*>(wordPointer(loadWordAt(block, 8))));
+        storeWordAt(block, 11, reply.status);
+        if (loadWordAt(block, 1) < 1024)
+            dmiConfirmFunc(block);
+        return 0;
     }
 };
-
-class ScriptedProvider {
-public:
-    // Initialises the SL library and installs the provider as its entry point.
-    ScriptedProvider();
-    // Waits for outstanding completions and cleans the library up.
-    ~ScriptedProvider();
-
-    // Replies are used in order; when none is queued, `responder` answers
-    // (default: accept with status 0 and an empty confirm).
-    void push(Reply reply) { queue_.push_back(std::move(reply)); }
-    std::function<Reply(const uint8_t* block)> responder;
-
-    // Copies of the command blocks as they were handed over, in order.
-    std::vector<std::vector<uint8_t>> blocks;
-    uint32_t word(size_t command, uint32_t index) const { return loadWordAt(blocks.at(command).data(), index); }
-    uint32_t code(size_t command) const { return word(command, 1); }
-
-    // Cleans the library up now (the destructor then does not).
-    void cleanupNow();
-    // Joins the thread of the last completion.
-    void joinCompletions();
-
-    static uint32_t invoke(void* block);
-
-private:
-    uint32_t answer(uint8_t* block);
-
-    std::vector<Reply> queue_;
-    size_t next_ = 0;
-    std::vector<std::thread> completions_;
-    void* (*confirmCallback_)(void*) = nullptr;
-    bool cleaned_ = false;
-};
-
-// The sleep requests the library made through the sleep hook since the
-// provider was created.
-std::vector<unsigned> sleepRequests();
-
-} // namespace sltest

@@ -1,0 +1,107 @@
+// The substitute provider's contract: the confirms and indications it writes
+// read through the SL accessors as the daemon reads them. The end-to-end
+// testbed is worth what this table pins.
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <functional>
+
+#include "dmisp/dmisp.h"
+#include "sl/sl.h"
+#include "sl/slaccess.h"
+#include "sl/slevent.h"
+#include "sl/slhandle.h"
+#include "sl/slkey.h"
+#include "sl/slmap.h"
+
+namespace {
+
+const char board[] = R"(start component name = "Test Board"
+  start group name = "ComponentID" class = "DMTF|ComponentID|001" id = 1
+    start attribute name = "Version" id = 3 type = displaystring(8) value = "2.90" end attribute
+  end group
+  start group name = "Voltage Events" class = "EventGeneration|Voltage Probe|001" id = 20
+    start attribute name = "Event Type" id = 1 type = start enum 1 = "Warning" 2 = "Failure" end enum value = 2 end attribute
+  end group
+  start group name = "Voltage Probe" class = "DMTF|Voltage Probe|001" key = 1
+    start attribute name = "Index" id = 1 type = integer end attribute
+    start attribute name = "Label" id = 2 type = displaystring(16) end attribute
+  end group
+  start table name = "Voltage Probe" class = "DMTF|Voltage Probe|001" id = 30 {1, "CPU"} {2, "Memory"} end table
+end component
+)";
+
+std::string text(const DmiString* s) { return s ? std::string(dmiStringText(s), dmiStringLength(s)) : "null"; }
+std::string seen;
+
+int handler(SLHandle* h)
+{
+    SLEventSelectRowCnf(h, 1, 0);
+    seen = std::to_string(SLEventClassCount(h)) + " " + text(SLEventClassString(h, 0)) + " " +
+           std::to_string(SLRowGroupId(h)) + " " + std::to_string(SLKeyCount(h)) + " " + text(SLRowStringPtr(h, 1));
+    return 0;
+}
+
+TEST(ProviderContract, ConfirmsAndIndicationsReadThroughTheAccessors)
+{
+    char dir[] = "/tmp/sl-contract-XXXXXX";
+    ASSERT_NE(mkdtemp(dir), nullptr);
+    ASSERT_EQ(dmisp::reset(dir, false), 0);
+    SLInitialize();
+    SLHandle* h = SLCreateHandle(0);
+    ASSERT_EQ(SLDmiRegisterMgmt(h, handler), 0);
+    std::string error;
+    uint32_t c = dmisp::installText(board, "board.mif", &error);
+    ASSERT_NE(c, 0u) << error;
+    SLKeyList* keys = nullptr;
+    float version = 0;
+    struct Row {
+        const char* name;
+        std::function<int()> command;
+        std::function<std::string()> read;
+        std::string want;
+    } rows[] = {
+        {"component", [&] { return SLListComponent(h, nullptr, c); },
+         [&] { return std::to_string(SLComponentId(h) == c) + text(SLComponentName(h)); }, "1Test Board"},
+        {"group", [&] { return SLListGroup(h, c, 30); },
+         [&] { return text(SLGroupName(h, 0)) + "/" + text(SLGroupClassName(h, 0)) + "/" + std::to_string(SLKeyCount(h)); },
+         "Voltage Probe/DMTF|Voltage Probe|001/1"},
+        {"attribute", [&] { return SLListAttribute(h, c, 20, 1); },
+         [&] { return text(SLAttributeName(h, 0)) + " " + std::to_string(SLEnumerationListCount(h, 0)) + " " +
+                      std::to_string(SLEnumerationValue(h, 0, 1)) + text(SLEnumerationName(h, 0, 1)); },
+         "Event Type 2 2Failure"},
+        {"get", [&] { return SLGetAttribute(h, c, 1, 3, nullptr); },
+         [&] { return std::to_string(SLAttributeType(h, 0)) + " " + text(SLStringPtr(h)); }, "8 2.90"},
+        {"first row", [&] { return SLGetFirstRow(h, c, 30, 0, nullptr); },
+         [&] {
+             keys = SLCreateKeyList(h);
+             return std::to_string(SLRowGroupId(h)) + " " + std::to_string(SLRowAttributeCount(h)) + " " +
+                    std::to_string(SLRowIntegerValue(h, 0)) + text(SLRowStringPtr(h, 1));
+         },
+         "30 2 1CPU"},
+        {"next row by keys", [&] { return SLGetNextRow(h, c, 30, 0, keys); },
+         [&] { return std::to_string(SLRowIntegerValue(h, 0)) + text(SLRowStringPtr(h, 1)); }, "2Memory"},
+        {"version by class", [&] { return SLGetInstalledMIFVersion(h, "Test Board", &version); },
+         [&] { return std::to_string(version).substr(0, 4); }, "2.90"},
+    };
+    for (const Row& row : rows) {
+        ASSERT_EQ(row.command(), 0) << row.name << ": status " << SLCnfStatus(h);
+        EXPECT_EQ(row.read(), row.want) << row.name;
+    }
+    SLDeleteKeyList(keys);
+    for (uint32_t level : {SL_LEVEL_CHECK, 0u}) {
+        dmisp::setIndicationLevelCheck(level);
+        seen.clear();
+        ASSERT_EQ(dmisp::raiseEvent(c, {20, {}}, {30, {"2"}}), 0u);
+        ASSERT_TRUE(dmisp::waitIndicationsCompleted());
+        EXPECT_EQ(seen, "2 EventGeneration|Voltage Probe|001 30 1 Memory") << "level check " << level;
+    }
+    SLDmiUnregisterMgmt(h);
+    dmisp::shutdown();
+    SLCleanup();
+    SLInitialize();
+    SLDmiInvoke = nullptr;
+    EXPECT_EQ(std::system(("rm -rf " + std::string(dir)).c_str()), 0);
+}
+
+} // namespace
