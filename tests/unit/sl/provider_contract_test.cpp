@@ -37,8 +37,8 @@ std::string seen;
 int handler(SLHandle* h)
 {
     SLEventSelectRowCnf(h, 1, 0);
-    seen = std::to_string(SLEventClassCount(h)) + " " + text(SLEventClassString(h, 0)) + " " +
-           std::to_string(SLRowGroupId(h)) + " " + std::to_string(SLKeyCount(h)) + " " + text(SLRowStringPtr(h, 1));
+    seen = std::to_string(SLEventClassCount(h)) + " " + std::to_string(SLKeyCount(h)) + " " +
+           std::to_string(SLRowGroupId(h)) + " " + text(SLRowStringPtr(h, 1)) + " " + text(SLEventClassString(h, 0));
     return 0;
 }
 
@@ -55,6 +55,7 @@ TEST(ProviderContract, ConfirmsAndIndicationsReadThroughTheAccessors)
     ASSERT_NE(c, 0u) << error;
     SLKeyList* keys = nullptr;
     float version = 0;
+    auto str = [](auto... parts) { return ((std::to_string(parts) + " ") + ...); };
     struct Row {
         const char* name;
         std::function<int()> command;
@@ -62,25 +63,23 @@ TEST(ProviderContract, ConfirmsAndIndicationsReadThroughTheAccessors)
         std::string want;
     } rows[] = {
         {"component", [&] { return SLListComponent(h, nullptr, c); },
-         [&] { return std::to_string(SLComponentId(h) == c) + text(SLComponentName(h)); }, "1Test Board"},
+         [&] { return str(SLComponentId(h) - c) + text(SLComponentName(h)); }, "0 Test Board"},
         {"group", [&] { return SLListGroup(h, c, 30); },
-         [&] { return text(SLGroupName(h, 0)) + "/" + text(SLGroupClassName(h, 0)) + "/" + std::to_string(SLKeyCount(h)); },
-         "Voltage Probe/DMTF|Voltage Probe|001/1"},
+         [&] { return str(SLKeyCount(h)) + text(SLGroupName(h, 0)) + "/" + text(SLGroupClassName(h, 0)); },
+         "1 Voltage Probe/DMTF|Voltage Probe|001"},
         {"attribute", [&] { return SLListAttribute(h, c, 20, 1); },
-         [&] { return text(SLAttributeName(h, 0)) + " " + std::to_string(SLEnumerationListCount(h, 0)) + " " +
-                      std::to_string(SLEnumerationValue(h, 0, 1)) + text(SLEnumerationName(h, 0, 1)); },
-         "Event Type 2 2Failure"},
+         [&] { return str(SLEnumerationListCount(h, 0), SLEnumerationValue(h, 0, 1)) + text(SLEnumerationName(h, 0, 1)); },
+         "2 2 Failure"},
         {"get", [&] { return SLGetAttribute(h, c, 1, 3, nullptr); },
-         [&] { return std::to_string(SLAttributeType(h, 0)) + " " + text(SLStringPtr(h)); }, "8 2.90"},
+         [&] { return str(SLAttributeType(h, 0)) + text(SLStringPtr(h)); }, "8 2.90"},
         {"first row", [&] { return SLGetFirstRow(h, c, 30, 0, nullptr); },
          [&] {
              keys = SLCreateKeyList(h);
-             return std::to_string(SLRowGroupId(h)) + " " + std::to_string(SLRowAttributeCount(h)) + " " +
-                    std::to_string(SLRowIntegerValue(h, 0)) + text(SLRowStringPtr(h, 1));
+             return str(SLRowGroupId(h), SLRowAttributeCount(h), SLRowIntegerValue(h, 0)) + text(SLRowStringPtr(h, 1));
          },
-         "30 2 1CPU"},
+         "30 2 1 CPU"},
         {"next row by keys", [&] { return SLGetNextRow(h, c, 30, 0, keys); },
-         [&] { return std::to_string(SLRowIntegerValue(h, 0)) + text(SLRowStringPtr(h, 1)); }, "2Memory"},
+         [&] { return str(SLRowIntegerValue(h, 0)) + text(SLRowStringPtr(h, 1)); }, "2 Memory"},
         {"version by class", [&] { return SLGetInstalledMIFVersion(h, "Test Board", &version); },
          [&] { return std::to_string(version).substr(0, 4); }, "2.90"},
     };
@@ -89,12 +88,11 @@ TEST(ProviderContract, ConfirmsAndIndicationsReadThroughTheAccessors)
         EXPECT_EQ(row.read(), row.want) << row.name;
     }
     SLDeleteKeyList(keys);
-    for (uint32_t level : {SL_LEVEL_CHECK, 0u}) {
+    for (uint32_t level : {SL_LEVEL_CHECK, 0u}) { // rows back to back, or an array of their offsets
         dmisp::setIndicationLevelCheck(level);
-        seen.clear();
         ASSERT_EQ(dmisp::raiseEvent(c, {20, {}}, {30, {"2"}}), 0u);
         ASSERT_TRUE(dmisp::waitIndicationsCompleted());
-        EXPECT_EQ(seen, "2 EventGeneration|Voltage Probe|001 30 1 Memory") << "level check " << level;
+        EXPECT_EQ(seen, "2 1 30 Memory EventGeneration|Voltage Probe|001") << "level check " << level;
     }
     SLDmiUnregisterMgmt(h);
     dmisp::shutdown();
