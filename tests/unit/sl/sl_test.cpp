@@ -5,6 +5,7 @@
 
 #include <chrono>
 #include <thread>
+#include <tuple>
 #include <utility>
 
 #include "scripted_provider.h"
@@ -17,7 +18,7 @@
 
 namespace {
 
-using Words = std::vector<std::pair<uint32_t, uint32_t>>;
+using Words = std::vector<uint32_t>; // word index, value, index, value ...
 
 SLKeyList keyList(std::vector<SLKeyEntry> entries)
 {
@@ -28,7 +29,8 @@ SLKeyList keyList(std::vector<SLKeyEntry> entries)
     return k;
 }
 
-// Code 0: refused before anything is sent. The row's name is its call.
+// A row: the call (also its name), the code sent (0: refused, nothing sent),
+// the block's words from 16 on and bytes at an offset.
 #define CMD(call, code, ...) {#call, [&] { return call; }, code, __VA_ARGS__}
 
 TEST(SLCommand, BlocksOfEveryCommand)
@@ -54,45 +56,39 @@ TEST(SLCommand, BlocksOfEveryCommand)
         uint32_t code;
         Words words = {};
         std::pair<uint32_t, std::string> bytes = {};
-    } rows[] = {
-        CMD(SLDmiUnregisterMgmt(h), 257), CMD(SLCancel(h), 258),
-        CMD(SLListComponent(h, nullptr, 7), 512, {{16, 7}, {17, 0}, {18, 0}}),
-        CMD(SLListComponent(h, "Zo", 7), 512, {{17, 80}, {20, 2}}, {84, "Zo"}),
-        CMD(SLListComponent(h, tooLong.c_str(), 7), 0), CMD(SLListFirstComponent(h, nullptr), 513, {{16, 0}, {17, 0}}),
-        CMD(SLListNextComponent(h, nullptr, 7), 514, {{16, 7}}), CMD(SLListComponentDesc(h, 7), 515, {{16, 7}, {19, 0}}),
-        CMD(SLListGroup(h, 7, 3), 516, {{16, 7}, {17, 3}}), CMD(SLListFirstGroup(h, 7), 517, {{16, 7}}),
-        CMD(SLListNextGroup(h, 7, 3), 518, {{16, 7}, {17, 3}}),
-        CMD(SLListGroupDesc(h, 7, 3), 519, {{16, 7}, {17, 3}, {19, 0}}),
-        CMD(SLListAttribute(h, 7, 3, 2), 520, {{16, 7}, {17, 3}, {18, 2}}),
-        CMD(SLListFirstAttribute(h, 7, 3), 521, {{16, 7}, {17, 3}}),
-        CMD(SLListNextAttribute(h, 7, 3, 2), 522, {{16, 7}, {17, 3}, {18, 2}}),
-        CMD(SLListAttributeDesc(h, 7, 3, 2), 523, {{18, 2}, {19, 0}}),
-        CMD(SLGetAttribute(h, 7, 3, 2, nullptr), 768, {{16, 7}, {17, 3}, {18, 0}, {19, 0}, {20, 2}}),
-        CMD(SLGetAttribute(h, 7, 3, 2, &k), 768,
-            {{18, 2}, {19, 84}, {21, 1}, {22, 5}, {23, 108}, {24, 2}, {25, 5}, {26, 112}, {27, 4}, {28, 9}}),
-        CMD(SLSetAttribute(h, 7, 3, 2, nullptr, 4, &v), 769, {{18, 0}, {19, 0}, {21, 88}, {22, v}}),
+    } rows[] = {CMD(SLDmiUnregisterMgmt(h), 257), CMD(SLCancel(h), 258),
+        CMD(SLListComponent(h, nullptr, 7), 512, {16, 7, 17, 0, 18, 0}),
+        CMD(SLListComponent(h, "Zo", 7), 512, {17, 80, 20, 2}, {84, "Zo"}), CMD(SLListComponent(h, tooLong.c_str(), 7), 0),
+        CMD(SLListFirstComponent(h, nullptr), 513, {16, 0, 17, 0}), CMD(SLListNextComponent(h, nullptr, 7), 514, {16, 7}),
+        CMD(SLListComponentDesc(h, 7), 515, {16, 7, 19, 0}), CMD(SLListGroup(h, 7, 3), 516, {16, 7, 17, 3}),
+        CMD(SLListFirstGroup(h, 7), 517, {16, 7}), CMD(SLListNextGroup(h, 7, 3), 518, {16, 7, 17, 3}),
+        CMD(SLListGroupDesc(h, 7, 3), 519, {16, 7, 17, 3, 19, 0}), CMD(SLListAttribute(h, 7, 3, 2), 520, {16, 7, 17, 3, 18, 2}),
+        CMD(SLListFirstAttribute(h, 7, 3), 521, {16, 7, 17, 3}),
+        CMD(SLListNextAttribute(h, 7, 3, 2), 522, {16, 7, 17, 3, 18, 2}),
+        CMD(SLListAttributeDesc(h, 7, 3, 2), 523, {16, 7, 17, 3, 18, 2, 19, 0}),
+        CMD(SLGetAttribute(h, 7, 3, 2, nullptr), 768, {16, 7, 17, 3, 18, 0, 19, 0, 20, 2}),
+        CMD(SLGetAttribute(h, 7, 3, 2, &k), 768, {18, 2, 19, 84, 21, 1, 22, 5, 23, 108, 24, 2, 25, 5, 26, 112, 27, 4, 28, 9}),
+        CMD(SLSetAttribute(h, 7, 3, 2, nullptr, 4, &v), 769, {18, 0, 19, 0, 21, 88, 22, v}),
         CMD(SLSetAttribute(h, 7, 3, 2, &k, 4, &v), 769,
-            {{16, 7}, {17, 3}, {18, 2}, {19, 88}, {20, 2}, {21, 120}, {22, 1}, {24, 112}, {28, 4}, {29, 9}, {30, v}}),
-        CMD(SLSetAttribute(h, 7, 3, 2, &mixed, fits.size(), fits.data()), 769, {{21, 123}}),
+            {16, 7, 17, 3, 18, 2, 19, 88, 20, 2, 21, 120, 22, 1, 24, 112, 28, 4, 29, 9, 30, v}),
+        CMD(SLSetAttribute(h, 7, 3, 2, &mixed, fits.size(), fits.data()), 769, {21, 123}),
         CMD(SLSetAttribute(h, 7, 3, 2, &mixed, fits.size() + 1, fits.data()), 0),
-        CMD(SLReserveAttribute(h, 7, 3, 2, &k), 770, {{19, 88}, {21, 120}}),
-        CMD(SLReleaseAttribute(h, 7, 3, 2, nullptr), 771, {{19, 0}, {21, 88}}),
-        CMD(SLGetRow(h, 7, 3, 0, &k), 772, {{16, 7}, {17, 3}, {18, 2}, {19, 84}, {20, 0}}),
-        CMD(SLGetRow(h, 7, 3, 0, &ten), 772, {{18, 10}, {48, 10}, {49, 5}, {50, 240}, {60, 19}}),
+        CMD(SLReserveAttribute(h, 7, 3, 2, &k), 770, {19, 88, 21, 120}),
+        CMD(SLReleaseAttribute(h, 7, 3, 2, nullptr), 771, {19, 0, 21, 88}),
+        CMD(SLGetRow(h, 7, 3, 0, &k), 772, {16, 7, 17, 3, 18, 2, 19, 84, 20, 0}),
+        CMD(SLGetRow(h, 7, 3, 0, &ten), 772, {18, 10, 48, 10, 49, 5, 50, 240, 60, 19}),
         CMD(SLGetRow(h, 7, 3, 0, &eleven), 0), CMD(SLSetAttribute(h, 7, 3, 2, &eleven, 0, nullptr), 0),
-        CMD(SLGetRow(h, 7, 3, 0, &mixed), 772, {{24, 2}, {26, 115}}, {108, std::string("\3\0\0\0abc\x09\0\0\0", 11)}),
-        CMD(SLGetFirstRow(h, 7, 3, 0, nullptr), 773, {{18, 0}, {19, 0}}),
-        CMD(SLGetNextRow(h, 7, 3, 0, &k), 774, {{18, 2}, {19, 84}}),
-        CMD(SLGetNextRow(h, 7, 3, 0, nullptr), 773, {{19, 0}}),
-        CMD(SLRegisterCi(h, 1, 2, 3, 2, pairs), 1024, {{16, 1}, {17, 2}, {18, 3}, {19, 2}, {20, 5}, {23, 8}}),
-        CMD(SLRegisterCi(h, 1, 2, 3, 502, pairs), 1024, {{19, 502}}), CMD(SLRegisterCi(h, 1, 2, 3, 503, pairs), 0),
-        CMD(SLUnregisterCi(h, 9), 1025, {{16, 9}}),
-        CMD(SLCiInstallData(h, 7, "/m"), 1026, {{16, 7}, {17, 1}, {18, 2}, {19, 80}, {20, 2}}, {84, {"/m\0", 3}}),
-        CMD(setenv("UXDMIPATH", "/d", 1) + SLInstallMIF(h, "a.mif"), 1026, {{16, 0}}, {84, {"/d/a.mif\0", 9}}),
+        CMD(SLGetRow(h, 7, 3, 0, &mixed), 772, {24, 2, 26, 115}, {108, std::string("\3\0\0\0abc\x09\0\0\0", 11)}),
+        CMD(SLGetFirstRow(h, 7, 3, 0, nullptr), 773, {18, 0, 19, 0}), CMD(SLGetNextRow(h, 7, 3, 0, &k), 774, {18, 2, 19, 84}),
+        CMD(SLGetNextRow(h, 7, 3, 0, nullptr), 773, {19, 0}),
+        CMD(SLRegisterCi(h, 1, 2, 3, 2, pairs), 1024, {16, 1, 17, 2, 18, 3, 19, 2, 20, 5, 23, 8}),
+        CMD(SLRegisterCi(h, 1, 2, 3, 502, pairs), 1024, {19, 502}), CMD(SLRegisterCi(h, 1, 2, 3, 503, pairs), 0),
+        CMD(SLUnregisterCi(h, 9), 1025, {16, 9}),
+        CMD(SLCiInstallData(h, 7, "/m"), 1026, {16, 7, 17, 1, 18, 2, 19, 80, 20, 2}, {84, {"/m\0", 3}}),
+        CMD(setenv("UXDMIPATH", "/d", 1) + SLInstallMIF(h, "a.mif"), 1026, {16, 0}, {84, {"/d/a.mif\0", 9}}),
         CMD(setenv("UXDMIPATH", tooLong.c_str(), 1) + SLInstallMIF(h, "a.mif"), 0),
         CMD(unsetenv("UXDMIPATH") + SLInstallMIF(h, "a.mif"), 1026, {}, {84, {"/var/dmi/mifs/backup/a.mif\0", 27}}),
-        CMD(SLCiUninstallData(h, 7), 1027, {{16, 7}}),
-    };
+        CMD(SLCiUninstallData(h, 7), 1027, {16, 7})};
     for (const Row& row : rows) {
         SCOPED_TRACE(row.name);
         size_t n = p.blocks.size();
@@ -102,14 +98,13 @@ TEST(SLCommand, BlocksOfEveryCommand)
         ASSERT_EQ(p.blocks.size(), n + (row.code == 0 ? 0 : 1));
         if (row.code == 0)
             continue;
-        uint32_t mgmt = row.code == 1026 || row.code == 1027 ? 0 : 77, number = p.word(n - 1, 4) + (row.code != 258);
-        // Level check, code, block size, management handle, command number (a cancel names the last command).
-        Words header{{0, SL_LEVEL_CHECK}, {1, row.code}, {2, 4096}, {3, mgmt}, {4, number}, {7, 8192}, {9, 1}};
-        for (auto [index, value] : header)
-            EXPECT_EQ(p.word(n, index), value) << "header word " << index;
-        EXPECT_EQ(p.word(n, 8), pointerWord(h->confirm));
-        for (auto [index, value] : row.words)
-            EXPECT_EQ(p.word(n, index), value) << "word " << index;
+        // Level check, code, block size, management handle (none for installs), command number (a cancel
+        // names the last command), confirm size and address, one confirm.
+        Words words{0, SL_LEVEL_CHECK, 1, row.code, 2, 4096, 3, row.code == 1026 || row.code == 1027 ? 0u : 77u, 4,
+            p.word(n - 1, 4) + (row.code != 258), 7, 8192, 8, pointerWord(h->confirm), 9, 1};
+        words.insert(words.end(), row.words.begin(), row.words.end());
+        for (size_t i = 0; i + 1 < words.size(); i += 2)
+            EXPECT_EQ(p.word(n, words[i]), words[i + 1]) << "word " << words[i];
         const auto& [offset, bytes] = row.bytes;
         EXPECT_EQ(std::string(reinterpret_cast<const char*>(p.blocks[n].data()) + offset, bytes.size()), bytes);
     }
@@ -117,24 +112,18 @@ TEST(SLCommand, BlocksOfEveryCommand)
 
 TEST(SLCommand, StatusAndBusyRules)
 {
-    struct Row {
-        const char* name;
-        std::vector<Reply> replies;
-        int rc;
-        size_t sends;
-        std::vector<unsigned> sleeps;
-    } rows[] = {
+    using Replies = std::vector<Reply>;
+    std::tuple<const char*, Replies, int, size_t, std::vector<unsigned>> rows[] = {
         {"status 0", {{0, 0}}, 0, 1, {}}, {"status 1 counts as success", {{0, 1}}, 0, 1, {}},
         {"status 2 fails", {{0, 2}}, 1, 1, {}}, {"refused", {{1, 0}}, 1, 1, {}},
         {"528 is not busy", {{528, 0}, {0, 0}}, 1, 1, {}}, {"busy once", {{529, 0}, {0, 0}}, 0, 2, {5000}},
-        {"busy twice: no third try", {{529, 0}, {529, 0}, {0, 0}}, 1, 2, {5000, 5000}},
-    };
-    for (const Row& row : rows) {
+        {"busy twice: no third try", {{529, 0}, {529, 0}, {0, 0}}, 1, 2, {5000, 5000}}};
+    for (const auto& [name, replies, rc, sends, sleeps] : rows) {
         ScriptedProvider p;
-        p.responder = [&](const uint8_t*) { return row.replies.at(p.blocks.size() - 1); };
-        EXPECT_EQ(SLListFirstComponent(SLCreateHandle(0), nullptr), row.rc) << row.name;
-        EXPECT_EQ(p.blocks.size(), row.sends) << row.name;
-        EXPECT_EQ(p.sleeps, row.sleeps) << row.name;
+        p.responder = [&](const uint8_t*) { return replies.at(p.blocks.size() - 1); };
+        EXPECT_EQ(SLListFirstComponent(SLCreateHandle(0), nullptr), rc) << name;
+        EXPECT_EQ(p.blocks.size(), sends) << name;
+        EXPECT_EQ(p.sleeps, sleeps) << name;
     }
 }
 
@@ -148,8 +137,8 @@ SLHandle* confirmOf(uint32_t type, const Words& words, const std::vector<std::pa
     std::memset(h->confirm, 0xAB, h->confirmSize);
     for (uint32_t i = 0; i < 16; ++i) // the indication header: level, type, length ... data offset
         storeWordAt(h->command, i, i == 0 ? level : i == 1 ? type : i == 2 ? length : i == 12 ? 64 : 0);
-    for (auto [index, value] : words)
-        storeWordAt(h->confirm, index, value);
+    for (size_t i = 0; i + 1 < words.size(); i += 2)
+        storeWordAt(h->confirm, words[i], words[i + 1]);
     for (const auto& [offset, text] : strings)
         putString(h->confirm, offset, text);
     return h;
@@ -159,73 +148,57 @@ std::string show(SLHandle*, uint32_t v) { return std::to_string(v); }
 std::string show(SLHandle*, int v) { return std::to_string(v); }
 std::string show(SLHandle*, DmiString* s) { return s ? std::string(dmiStringText(s), dmiStringLength(s)) : "null"; }
 std::string show(SLHandle* h, void* p) { return p ? "@" + std::to_string(static_cast<uint8_t*>(p) - h->confirm) : "null"; }
-#define ROW(h, expr, want) {#expr, [&] { return show(h, expr); }, want}
+// A row: the accessor, its handle and arguments, and the value it must read.
+#define A(h, fn, want, ...) {#fn "(" #h ", " #__VA_ARGS__ ")", [&] { return show(h, fn(h __VA_OPT__(, ) __VA_ARGS__)); }, want}
 
 TEST(SLAccess, EveryLayout)
 {
     ScriptedProvider p;
-    SLHandle* reg = confirmOf(256, {{0, 100}, {1, 120}, {2, 77}}, {{100, "1.1"}, {120, "Sub"}});
-    SLHandle* comp = confirmOf(512, {{0, 7}, {1, 1}, {2, 100}, {3, 2}, {4, 120}, {5, 1}, {6, 140}, {30, 1}, {31, 160},
-                                     {32, 2}, {33, 170}, {35, 3}, {36, 180}, {2045, 9}},
-                               {{100, "Board"}, {160, "G1"}, {170, "G2"}});
+    SLHandle* reg = confirmOf(256, {0, 100, 1, 120, 2, 77}, {{100, "1.1"}, {120, "Sub"}});
+    SLHandle* comp = confirmOf(512, {0, 7, 1, 1, 2, 100, 3, 2, 4, 120, 5, 1, 6, 140, 30, 1, 31, 160, 32, 2, 33, 170, 35, 3,
+        36, 180, 2045, 9}, {{100, "Board"}, {160, "G1"}, {170, "G2"}});
     SLHandle* desc = confirmOf(515, {}, {{0, "About"}});
-    SLHandle* group = confirmOf(516, {{0, 30}, {1, 200}, {2, 240}, {3, 1}, {4, 300}, {5, 31}, {6, 220}, {7, 260}},
-                                {{200, "A"}, {220, "B"}, {240, "C1"}, {260, "C2"}});
-    SLHandle* attr = confirmOf(520, {{0, 2}, {2, 2}, {5, 2}, {6, 320}, {7, 3}, {8, 310}, {10, 8}, {11, 64}, {13, 0},
-                                     {80, 1}, {81, 340}, {82, 0xFFFFFFFE}, {83, 360}},
-                               {{310, "Label"}, {340, "Warning"}, {360, "Failure"}});
-    SLHandle* get = confirmOf(768, {{2, 8}, {3, 100}}, {{100, "2.90"}});
-    SLHandle* row = confirmOf(772, {{0, 30}, {1, 1}, {2, 100}, {3, 2}, {5, 1}, {6, 5}, {7, 200}, {9, 2}, {10, 8},
-                                    {11, 210}, {50, 0xFFFFFFFD}},
-                              {{210, "CPU"}});
+    SLHandle* group = confirmOf(516, {0, 30, 1, 200, 2, 240, 3, 1, 4, 300, 5, 31, 6, 220, 7, 260},
+        {{200, "A"}, {220, "B"}, {240, "C1"}, {260, "C2"}});
+    SLHandle* attr = confirmOf(520, {0, 2, 2, 2, 5, 2, 6, 320, 7, 3, 8, 310, 10, 8, 11, 64, 13, 0, 80, 1, 81, 340, 82,
+        0xFFFFFFFE, 83, 360}, {{310, "Label"}, {340, "Warning"}, {360, "Failure"}});
+    SLHandle* get = confirmOf(768, {2, 8, 3, 100}, {{100, "2.90"}});
+    SLHandle* row = confirmOf(772, {0, 30, 1, 1, 2, 100, 3, 2, 5, 1, 6, 5, 7, 200, 9, 2, 10, 8, 11, 210, 50, 0xFFFFFFFD},
+        {{210, "CPU"}});
     // Indications: the stated length bounds every read, whatever lies behind it.
-    SLHandle* removed = confirmOf(3, {{16, 9}, {18, 140}}, {{140, "Out"}}, 120);
+    SLHandle* removed = confirmOf(3, {16, 9, 18, 140}, {{140, "Out"}}, 120);
     // An event of one class with two rows of one attribute: rows back to back
     // from 240, or an array of their offsets at 400.
-    Words event{{16, 1}, {17, 7}, {18, 500}, {19, 2}, {20, 240}, {60, 20}, {63, 1}, {65, 1}, {66, 5}, {67, 340},
-                {68, 30}, {69, 1}, {70, 320}, {71, 1}, {73, 7}, {74, 5}, {75, 344}, {80, 7}, {81, 5}, {82, 344},
-                {85, 11}, {86, 22}, {100, 240}, {101, 272}};
+    Words event{16, 1, 17, 7, 18, 500, 19, 2, 20, 240, 60, 20, 63, 1, 65, 1, 66, 5, 67, 340, 68, 30, 69, 1, 70, 320,
+        71, 1, 73, 7, 74, 5, 75, 344, 80, 7, 81, 5, 82, 344, 85, 11, 86, 22, 100, 240, 101, 272};
     SLHandle* rows1 = confirmOf(1, event, {{500, "EventGeneration|x"}}, 510);
-    event[4].second = 400;
+    event[9] = 400;
     SLHandle* rows2 = confirmOf(1, event, {{500, "EventGeneration|x"}}, 560, 0x444D4932);
     SLEventSelectRowCnf(rows1, 0, 1);
     SLEventSelectRowCnf(rows2, 0, 1);
-    struct Row {
-        const char* name;
-        std::function<std::string()> read;
-        std::string want;
-    } rows[] = {
-        ROW(reg, SLDmiSpecificationLevel(reg), "1.1"), ROW(reg, SLImplementationDescription(reg), "Sub"),
-        ROW(reg, SLRegisterHandle(reg), "77"), ROW(comp, SLComponentId(comp), "7"),
-        ROW(comp, SLComponentMatchType(comp), "1"), ROW(comp, SLComponentName(comp), "Board"),
-        ROW(comp, SLComponentGroupCount(comp), "2"), ROW(comp, SLComponentGroupId(comp, 1), "2"),
-        ROW(comp, SLComponentGroupName(comp, 1), "G2"), ROW(comp, SLComponentFileCount(comp), "1"),
-        ROW(comp, SLComponentFileType(comp, 0), "3"), ROW(comp, SLComponentFileData(comp, 0), "@180"),
-        ROW(comp, SLComponentGroupId(comp, 2000), "0"), ROW(comp, SLComponentGroupId(comp, 0x7FFFFFFF), "0"),
-        ROW(desc, SLDescription(desc), "About"), ROW(group, SLGroupId(group, 1), "31"),
-        ROW(group, SLGroupName(group, 1), "B"), ROW(group, SLGroupClassName(group, 0), "C1"),
-        ROW(group, SLGroupClassName(group, 1), "C2"), ROW(group, SLKeyCount(group), "1"),
-        ROW(group, SLKeyListOffset(group), "300"), ROW(attr, SLAttributeId(attr, 1), "3"),
-        ROW(attr, SLAttributeName(attr, 1), "Label"), ROW(attr, SLAttributeAccess(attr, 0), "2"),
-        ROW(attr, SLAttributeType(attr, 1), "8"), ROW(attr, SLAttributeMaxSize(attr, 1), "64"),
-        ROW(attr, SLEnumerationListCount(attr, 0), "2"), ROW(attr, SLEnumerationValue(attr, 0, 1), "-2"),
-        ROW(attr, SLEnumerationName(attr, 0, 1), "Failure"), ROW(attr, SLEnumerationName(attr, 1, 0), "null"),
-        ROW(get, SLAttributeType(get, 5), "8"), ROW(get, SLAttributePtr(get), "@100"),
-        ROW(get, SLStringPtr(get), "2.90"), ROW(get, SLUnsignedValue(get), "4"),
-        ROW(row, SLRowGroupId(row), "30"), ROW(row, SLRowAttributeCount(row), "2"),
-        ROW(row, SLRowAttributeId(row, 1), "2"), ROW(row, SLRowAttributeType(row, 1), "8"),
-        ROW(row, SLRowStringPtr(row, 1), "CPU"), ROW(row, SLRowIntegerValue(row, 0), "-3"),
-        ROW(row, SLRowAttributePtr(row, 0), "@200"), ROW(row, SLRowAttributeId(row, 600), "0"),
-        ROW(row, SLKeyCount(row), "1"), ROW(removed, SLComponentId(removed), "9"),
-        ROW(removed, SLComponentName(removed), "null"), ROW(rows1, SLEventClassCount(rows1), "1"),
-        ROW(rows1, SLEventComponentId(rows1, 0), "7"), ROW(rows1, SLEventRowCount(rows1, 0), "2"),
-        ROW(rows1, SLEventClassString(rows1, 0), "null"), ROW(rows2, SLEventClassString(rows2, 0), "EventGeneration|x"),
-        ROW(rows1, SLRowGroupId(rows1), "30"), ROW(rows2, SLRowGroupId(rows2), "30"),
-        ROW(rows1, SLRowAttributeId(rows1, 0), "7"), ROW(rows2, SLRowUnsignedValue(rows2, 0), "22"),
-        ROW(rows1, SLKeyListOffset(rows1), "320"),
-    };
-    for (const Row& r : rows)
-        EXPECT_EQ(r.read(), r.want) << r.name;
+    std::tuple<const char*, std::function<std::string()>, std::string> rows[] = {
+        A(reg, SLDmiSpecificationLevel, "1.1"), A(reg, SLImplementationDescription, "Sub"), A(reg, SLRegisterHandle, "77"),
+        A(comp, SLComponentId, "7"), A(comp, SLComponentMatchType, "1"), A(comp, SLComponentName, "Board"),
+        A(comp, SLComponentGroupCount, "2"), A(comp, SLComponentGroupId, "2", 1), A(comp, SLComponentGroupName, "G2", 1),
+        A(comp, SLComponentFileCount, "1"), A(comp, SLComponentFileType, "3", 0), A(comp, SLComponentFileData, "@180", 0),
+        A(comp, SLComponentGroupId, "0", 2000), A(comp, SLComponentGroupId, "0", 0x7FFFFFFF),
+        A(desc, SLDescription, "About"), A(group, SLGroupId, "31", 1), A(group, SLGroupName, "B", 1),
+        A(group, SLGroupClassName, "C1", 0), A(group, SLGroupClassName, "C2", 1), A(group, SLKeyCount, "1"),
+        A(group, SLKeyListOffset, "300"), A(attr, SLAttributeId, "3", 1), A(attr, SLAttributeName, "Label", 1),
+        A(attr, SLAttributeAccess, "2", 0), A(attr, SLAttributeType, "8", 1), A(attr, SLAttributeMaxSize, "64", 1),
+        A(attr, SLEnumerationListCount, "2", 0), A(attr, SLEnumerationValue, "-2", 0, 1),
+        A(attr, SLEnumerationName, "Failure", 0, 1), A(attr, SLEnumerationName, "null", 1, 0),
+        A(get, SLAttributeType, "8", 5), A(get, SLAttributePtr, "@100"), A(get, SLStringPtr, "2.90"),
+        A(get, SLUnsignedValue, "4"), A(row, SLRowGroupId, "30"), A(row, SLRowAttributeCount, "2"),
+        A(row, SLRowAttributeId, "2", 1), A(row, SLRowAttributeType, "8", 1), A(row, SLRowStringPtr, "CPU", 1),
+        A(row, SLRowIntegerValue, "-3", 0), A(row, SLRowAttributePtr, "@200", 0), A(row, SLRowAttributeId, "0", 600),
+        A(row, SLKeyCount, "1"), A(removed, SLComponentId, "9"), A(removed, SLComponentName, "null"),
+        A(rows1, SLEventClassCount, "1"), A(rows1, SLEventComponentId, "7", 0), A(rows1, SLEventRowCount, "2", 0),
+        A(rows1, SLEventClassString, "null", 0), A(rows2, SLEventClassString, "EventGeneration|x", 0),
+        A(rows1, SLRowGroupId, "30"), A(rows2, SLRowGroupId, "30"), A(rows1, SLRowAttributeId, "7", 0),
+        A(rows2, SLRowUnsignedValue, "22", 0), A(rows1, SLKeyListOffset, "320")};
+    for (const auto& [name, read, want] : rows)
+        EXPECT_EQ(read(), want) << name;
     storeWordAt(comp->confirm, 2, 8180); // a name whose count runs past the buffer's end
     EXPECT_EQ(show(comp, SLComponentName(comp)), "null");
     storeWordAt(row->confirm, 3, 0x7FFFFFFF); // a hostile count: only the entries that fit
@@ -235,9 +208,9 @@ TEST(SLAccess, EveryLayout)
 TEST(SLKey, CopyAndCompare)
 {
     ScriptedProvider p;
-    Words words{{0, 30}, {3, 10}, {4, 100}}; // group entry 0: 10 integer keys listed at 100, values from 300
+    Words words{0, 30, 3, 10, 4, 100}; // group entry 0: 10 integer keys listed at 100, values from 300
     for (uint32_t i = 0; i < 11; ++i)
-        words.insert(words.end(), {{25 + 3 * i, i + 1}, {26 + 3 * i, DMI_INTEGER}, {27 + 3 * i, 300 + 4 * i}, {75 + i, 40 + i}});
+        words.insert(words.end(), {25 + 3 * i, i + 1, 26 + 3 * i, DMI_INTEGER, 27 + 3 * i, 300 + 4 * i, 75 + i, 40 + i});
     SLHandle* h = confirmOf(516, words);
     SLKeyList* ten = SLCreateKeyList(h);
     ASSERT_NE(ten, nullptr) << "a row of exactly 10 keys";
@@ -253,11 +226,7 @@ TEST(SLKey, CopyAndCompare)
     uint32_t one = 1, two = 2;
     uint64_t big1 = 1, big2 = 2;
     uint8_t abc[7] = {3, 0, 0, 0, 'a', 'b', 'c'}, abd[7] = {3, 0, 0, 0, 'a', 'b', 'd'};
-    struct Row {
-        const char* name;
-        SLKeyList a, b;
-        int equal;
-    } rows[] = {
+    std::tuple<const char*, SLKeyList, SLKeyList, int> rows[] = {
         {"same integer", keyList({{1, DMI_INTEGER, &one}}), keyList({{1, DMI_INTEGER, &one}}), 1},
         {"other integer", keyList({{1, DMI_INTEGER, &one}}), keyList({{1, DMI_INTEGER, &two}}), 0},
         {"other counter", keyList({{1, DMI_COUNTER, &one}}), keyList({{1, DMI_COUNTER, &two}}), 0},
@@ -270,8 +239,8 @@ TEST(SLKey, CopyAndCompare)
         {"other count", keyList({{1, DMI_INTEGER, &one}}), keyList({}), 0},
         {"eleven keys", keyList(std::vector<SLKeyEntry>(11)), keyList(std::vector<SLKeyEntry>(11)), 0},
     };
-    for (Row& r : rows)
-        EXPECT_EQ(SLCompareKeyLists(&r.a, &r.b), r.equal) << r.name;
+    for (auto& [name, a, b, equal] : rows)
+        EXPECT_EQ(SLCompareKeyLists(&a, &b), equal) << name;
 }
 
 TEST(SLMap, NameWalks)
@@ -313,12 +282,10 @@ TEST(SLCleanup, LetsWaitingCommandsLeave)
         failed += SLListFirstComponent(h, nullptr);
         ++left;
     };
-    SLHandle* h1 = SLCreateHandle(0);
-    SLHandle* h2 = SLCreateHandle(0);
-    std::thread first(command, h1);
+    std::thread first(command, SLCreateHandle(0));
     while (p.received.load() == 0)
         std::this_thread::yield();
-    std::thread second(command, h2);
+    std::thread second(command, SLCreateHandle(0)); // made before cleanup begins
     std::this_thread::sleep_for(std::chrono::milliseconds(200));
     p.cleanup();
     EXPECT_EQ(left.load(), 2) << "cleanup returned before the commands left";
@@ -328,23 +295,21 @@ TEST(SLCleanup, LetsWaitingCommandsLeave)
     EXPECT_EQ(p.received.load(), 1);
 }
 
-std::atomic<bool> holdHandler{false}, holdCompletion{false};
+std::atomic<bool> hold{false};
 std::atomic<int> handled{0}, completions{0};
 std::string seen;
 
 int handler(SLHandle* h)
 {
     seen = std::to_string(SLIndicationComponentId(h)) + " " + std::to_string(SLEventClassCount(h));
-    ++handled;
-    while (holdHandler)
+    for (++handled; hold;)
         std::this_thread::yield();
     return 0;
 }
 
 void completion(void*)
 {
-    ++completions;
-    while (holdCompletion)
+    for (++completions; hold;)
         std::this_thread::yield();
 }
 
@@ -357,40 +322,34 @@ std::vector<uint32_t> event(uint32_t length)
     return w;
 }
 
+// Copied for the handler and completed once, or dropped (and completed) when
+// the stated length is absurd.
 TEST(SLEvent, DeliveredOrDroppedAndCompletedOnce)
 {
     ScriptedProvider p;
     SLEventSetHandler(handler);
-    struct Row {
-        const char* name;
-        uint32_t length;
-        std::string seen; // "" when the handler must not run
-    } rows[] = {
-        {"an event", 80, "7 1"}, {"exactly its header", 52, "7 0"},
-        {"shorter than its header", 51, ""}, {"above 1 MiB", (1u << 20) + 1, ""},
-    };
-    for (const Row& row : rows) {
+    std::tuple<const char*, uint32_t, std::string> rows[] = {{"an event", 80, "7 1"}, {"exactly its header", 52, "7 0"},
+        {"shorter than its header", 51, ""}, {"above 1 MiB", (1u << 20) + 1, ""}}; // "": the handler must not run
+    for (const auto& [name, length, want] : rows) {
         seen.clear();
         int before = completions, handledBefore = handled;
-        std::vector<uint32_t> indication = event(row.length);
+        std::vector<uint32_t> indication = event(length);
         SLIndicationFunc(indication.data());
         for (int i = 0; i < 5000 && completions.load() == before; ++i)
             std::this_thread::sleep_for(std::chrono::milliseconds(1));
-        EXPECT_EQ(completions.load(), before + 1) << row.name;
-        EXPECT_EQ(handled.load(), handledBefore + (row.seen.empty() ? 0 : 1)) << row.name;
-        EXPECT_EQ(seen, row.seen) << row.name;
+        EXPECT_EQ(completions.load(), before + 1) << name;
+        EXPECT_EQ(handled.load(), handledBefore + (want.empty() ? 0 : 1)) << name;
+        EXPECT_EQ(seen, want) << name;
     }
     SLEventSetHandler(nullptr);
 }
 
-// `hold` keeps the handler or the completion busy while `act` runs on a
-// thread of its own: `act` must not end before it is released. Removing the
-// handler waits for running event threads; cleanup waits for a provider
-// still inside the indication callback (which completes at once, with no
-// handler installed).
+// While the handler (or, with no handler, the completion inside the
+// indication callback) is held, removing the handler and cleanup must wait.
 TEST(SLEvent, RemovingTheHandlerAndCleanupWaitForDelivery)
 {
-    auto expectWaits = [](std::atomic<bool>& hold, std::atomic<int>& entered, const std::function<void()>& act) {
+    ScriptedProvider p;
+    auto expectWaits = [](std::atomic<int>& entered, const std::function<void()>& act) {
         hold = true;
         int before = entered;
         std::vector<uint32_t> indication = event(80);
@@ -398,20 +357,16 @@ TEST(SLEvent, RemovingTheHandlerAndCleanupWaitForDelivery)
         while (entered.load() == before)
             std::this_thread::yield();
         std::atomic<bool> over{false};
-        std::thread actor([&] {
-            act();
-            over = true;
-        });
+        std::thread actor([&] { act(), over = true; });
         std::this_thread::sleep_for(std::chrono::milliseconds(100));
         EXPECT_FALSE(over.load());
         hold = false;
         provider.join();
         actor.join();
     };
-    ScriptedProvider p;
     SLEventSetHandler(handler);
-    expectWaits(holdHandler, handled, [] { SLEventSetHandler(nullptr); });
-    expectWaits(holdCompletion, completions, [&] { p.cleanup(); });
+    expectWaits(handled, [] { SLEventSetHandler(nullptr); });
+    expectWaits(completions, [&] { p.cleanup(); });
 }
 
 } // namespace
