@@ -1,16 +1,23 @@
-// An in-process DMI provider for the SL tests: it keeps a copy of every
-// command block it is handed and answers as `responder` says, confirming
-// before DmiInvoke returns.
+// What the SL tests share: the library's headers, DMI string helpers, and an
+// in-process DMI provider that keeps a copy of every command block it is
+// handed and answers as `responder` says, confirming before DmiInvoke returns.
 #pragma once
 
 #include <atomic>
 #include <cstring>
 #include <functional>
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include "base/sleep.h"
 #include "sl/sl.h"
+#include "sl/slaccess.h"
+#include "sl/slevent.h"
+#include "sl/slhandle.h"
+#include "sl/slkey.h"
+#include "sl/slmap.h"
+#include "sl/slstring.h"
 
 struct Reply {
     uint32_t invoke = 0;  // DmiInvoke's result: 0 accepted, 529 busy, else refused
@@ -19,12 +26,17 @@ struct Reply {
     std::function<void(uint8_t* confirm)> fill = nullptr;
 };
 
+inline std::string text(const DmiString* s) { return s ? std::string(dmiStringText(s), dmiStringLength(s)) : "null"; }
+
 // Writes a DMI string at `offset` of `base`.
 inline void putString(uint8_t* base, uint32_t offset, const std::string& text)
 {
     storeWord(base + offset, static_cast<uint32_t>(text.size()));
     std::memcpy(base + offset + 4, text.data(), text.size());
 }
+
+struct ScriptedProvider;
+inline ScriptedProvider* provider = nullptr;
 
 struct ScriptedProvider {
     std::function<Reply(const uint8_t* block)> responder = [](const uint8_t*) { return Reply{}; };
@@ -33,30 +45,22 @@ struct ScriptedProvider {
     std::vector<unsigned> sleeps; // requested through the sleep hook
     bool cleaned = false;
 
-    static ScriptedProvider*& current()
-    {
-        static ScriptedProvider* provider = nullptr;
-        return provider;
-    }
     ScriptedProvider()
     {
-        current() = this;
-        moxSetSleepHook([](unsigned ms) { current()->sleeps.push_back(ms); });
+        provider = this;
+        moxSetSleepHook([](unsigned ms) { provider->sleeps.push_back(ms); });
         SLInitialize();
         SLDmiInvoke = [](void* command) {
-            ScriptedProvider& p = *current();
             auto* block = static_cast<uint8_t*>(command);
-            p.blocks.emplace_back(block, block + SL_COMMAND_SIZE);
-            ++p.received;
-            Reply reply = p.responder(block);
-            if (reply.invoke != 0 || !reply.confirm)
-                return reply.invoke;
-            if (reply.fill)
+            provider->blocks.emplace_back(block, block + SL_COMMAND_SIZE);
+            Reply reply = provider->responder(block);
+            ++provider->received;
+            if (reply.invoke == 0 && reply.confirm && reply.fill)
                 reply.fill(static_cast<uint8_t*>(wordPointer(loadWordAt(block, 8))));
             storeWordAt(block, 11, reply.status);
-            if (loadWordAt(block, 1) < 1024) // the component-interface commands are final at once
+            if (reply.invoke == 0 && reply.confirm && loadWordAt(block, 1) < 1024) // 1024-1027 are final at once
                 dmiConfirmFunc(block);
-            return 0u;
+            return reply.invoke;
         };
     }
     ~ScriptedProvider()
@@ -66,11 +70,6 @@ struct ScriptedProvider {
         SLDmiInvoke = nullptr;
         moxSetSleepHook(nullptr);
     }
-    void cleanup()
-    {
-        if (!cleaned)
-            SLCleanup();
-        cleaned = true;
-    }
+    void cleanup() { cleaned = cleaned || (SLCleanup(), true); }
     uint32_t word(size_t block, uint32_t index) const { return loadWordAt(blocks.at(block).data(), index); }
 };
