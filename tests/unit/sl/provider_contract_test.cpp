@@ -71,8 +71,6 @@ TEST(ProviderContract, ConfirmsAndIndicationsReadThroughTheAccessors)
     SLDmiUnregisterMgmt(h);
     dmisp::shutdown();
     SLCleanup();
-    SLInitialize();
-    SLDmiInvoke = nullptr;
     EXPECT_EQ(std::system(("rm -rf " + std::string(dir)).c_str()), 0);
 }
 

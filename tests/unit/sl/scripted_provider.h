@@ -35,10 +35,8 @@ inline void putString(uint8_t* base, uint32_t offset, const std::string& text)
     std::memcpy(base + offset + 4, text.data(), text.size());
 }
 
-struct ScriptedProvider;
-inline ScriptedProvider* provider = nullptr;
-
 struct ScriptedProvider {
+    static inline ScriptedProvider* provider = nullptr; // the one in use
     std::function<Reply(const uint8_t* block)> responder = [](const uint8_t*) { return Reply{}; };
     std::vector<std::vector<uint8_t>> blocks;
     std::atomic<int> received{0};
