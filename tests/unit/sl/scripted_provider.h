@@ -3,7 +3,6 @@
 // handed and answers as `responder` says, confirming before DmiInvoke returns.
 #pragma once
 
-#include <atomic>
 #include <cstring>
 #include <functional>
 #include <string>
@@ -39,7 +38,6 @@ struct ScriptedProvider {
     static inline ScriptedProvider* provider = nullptr; // the one in use
     std::function<Reply(const uint8_t* block)> responder = [](const uint8_t*) { return Reply{}; };
     std::vector<std::vector<uint8_t>> blocks;
-    std::atomic<int> received{0};
     std::vector<unsigned> sleeps; // requested through the sleep hook
     bool cleaned = false;
 
@@ -52,7 +50,6 @@ struct ScriptedProvider {
             auto* block = static_cast<uint8_t*>(command);
             provider->blocks.emplace_back(block, block + SL_COMMAND_SIZE);
             Reply reply = provider->responder(block);
-            ++provider->received;
             if (reply.invoke == 0 && reply.confirm && reply.fill)
                 reply.fill(static_cast<uint8_t*>(wordPointer(loadWordAt(block, 8))));
             storeWordAt(block, 11, reply.status);
@@ -64,8 +61,6 @@ struct ScriptedProvider {
     ~ScriptedProvider()
     {
         cleanup();
-        SLInitialize(); // leave the library usable, with no provider
-        SLDmiInvoke = nullptr;
         moxSetSleepHook(nullptr);
     }
     void cleanup() { cleaned = cleaned || (SLCleanup(), true); }
