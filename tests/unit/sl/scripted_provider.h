@@ -58,11 +58,7 @@ struct ScriptedProvider {
             return reply.invoke;
         };
     }
-    ~ScriptedProvider()
-    {
-        cleanup();
-        moxSetSleepHook(nullptr);
-    }
+    ~ScriptedProvider() { cleanup(), moxSetSleepHook(nullptr); }
     void cleanup() { cleaned = cleaned || (SLCleanup(), true); }
     uint32_t word(size_t block, uint32_t index) const { return loadWordAt(blocks.at(block).data(), index); }
 };

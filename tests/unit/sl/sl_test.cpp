@@ -137,14 +137,9 @@ SLHandle* confirmOf(uint32_t type, const Words& words, const Strings& strings = 
 
 template <typename Number> std::string show(SLHandle*, Number n) { return std::to_string(n); }
 std::string show(SLHandle*, DmiString* s) { return text(s); }
-std::string show(SLHandle*, SLKeyList* k) // "count:tenth value"
-{
-    return k ? std::to_string(k->count) + ":" + std::to_string(loadWord(k->keys[9].value)) : "null";
-}
-std::string show(SLHandle* h, void* p) { return p ? "@" + show(h, static_cast<uint8_t*>(p) - h->confirm) : "null"; }
+std::string show(SLHandle*, SLKeyList* k) { return k ? std::to_string(loadWord(k->keys[9].value)) : "null"; }
 // A row: the accessor, its handle and arguments, and the value it must read.
-#define A(h, fn, want, ...)                                                                                            \
-    {#fn "(" #h ", " #__VA_ARGS__ ")", [&] { return show(h, fn(h __VA_OPT__(, ) __VA_ARGS__)); }, want}
+#define A(h, f, w, ...) {#f "(" #h ", " #__VA_ARGS__ ")", [&] { return show(h, f(h __VA_OPT__(, ) __VA_ARGS__)); }, w}
 
 TEST(SLAccess, EveryLayout)
 {
@@ -179,21 +174,20 @@ TEST(SLAccess, EveryLayout)
     SLEventSelectRowCnf(rows2, 0, 1);
     std::tuple<const char*, std::function<std::string()>, std::string> rows[] = {A(comp, SLComponentId, "7"),
         A(comp, SLComponentName, "Board"), A(comp, SLComponentGroupCount, "2"), A(comp, SLComponentGroupId, "2", 1),
-        A(comp, SLComponentGroupName, "G2", 1), A(comp, SLComponentGroupId, "0", 2000),
-        A(comp, SLComponentGroupId, "0", 0x7FFFFFFF), A(group, SLGroupId, "31", 1), A(group, SLGroupName, "B", 1),
-        A(group, SLGroupClassName, "C1", 0), A(group, SLGroupClassName, "C2", 1), A(group, SLKeyCount, "1"),
-        A(ten, SLCreateKeyList, "10:49"), A(eleven, SLCreateKeyList, "null"), A(outside, SLCreateKeyList, "null"),
-        A(attr, SLAttributeId, "3", 1), A(attr, SLAttributeName, "Label", 1), A(attr, SLAttributeType, "8", 1),
-        A(attr, SLEnumerationListCount, "2", 0), A(attr, SLEnumerationValue, "-2", 0, 1),
-        A(attr, SLEnumerationName, "Failure", 0, 1), A(attr, SLEnumerationName, "null", 1, 0),
-        A(row, SLRowGroupId, "30"), A(row, SLRowAttributeCount, "2"), A(row, SLRowAttributeId, "2", 1),
-        A(row, SLRowAttributeType, "8", 1), A(row, SLRowStringPtr, "CPU", 1), A(row, SLRowIntegerValue, "-3", 0),
-        A(row, SLRowAttributePtr, "@200", 0), A(row, SLRowAttributeId, "0", 600), A(row, SLKeyCount, "1"),
+        A(comp, SLComponentGroupName, "G2", 1), A(comp, SLComponentGroupId, "0", 0x7FFFFFFF),
+        A(group, SLGroupId, "31", 1), A(group, SLGroupName, "B", 1), A(group, SLGroupClassName, "C1", 0),
+        A(group, SLGroupClassName, "C2", 1), A(group, SLKeyCount, "1"), A(ten, SLCreateKeyList, "49"),
+        A(eleven, SLCreateKeyList, "null"), A(outside, SLCreateKeyList, "null"), A(attr, SLAttributeId, "3", 1),
+        A(attr, SLAttributeName, "Label", 1), A(attr, SLAttributeType, "8", 1), A(attr, SLEnumerationListCount, "2", 0),
+        A(attr, SLEnumerationValue, "-2", 0, 1), A(attr, SLEnumerationName, "Failure", 0, 1),
+        A(attr, SLEnumerationName, "null", 1, 0), A(row, SLRowGroupId, "30"), A(row, SLRowAttributeCount, "2"),
+        A(row, SLRowAttributeId, "2", 1), A(row, SLRowAttributeType, "8", 1), A(row, SLRowStringPtr, "CPU", 1),
+        A(row, SLRowIntegerValue, "-3", 0), A(row, SLRowAttributeId, "0", 600), A(row, SLKeyCount, "1"),
         A(removed, SLComponentId, "9"), A(removed, SLComponentName, "null"), A(rows1, SLEventClassCount, "1"),
         A(rows1, SLEventComponentId, "7", 0), A(rows1, SLEventRowCount, "2", 0),
         A(rows1, SLEventClassString, "null", 0), A(rows2, SLEventClassString, "EventGeneration|x", 0),
         A(rows1, SLRowGroupId, "30"), A(rows2, SLRowGroupId, "30"), A(rows1, SLRowAttributeId, "7", 0),
-        A(rows2, SLRowUnsignedValue, "22", 0), A(rows1, SLKeyListOffset, "320")};
+        A(rows2, SLRowUnsignedValue, "22", 0)};
     for (const auto& [name, read, want] : rows)
         EXPECT_EQ(read(), want) << name;
     storeWordAt(comp->confirm, 2, 8180); // a name whose count runs past the buffer's end
@@ -204,8 +198,7 @@ TEST(SLAccess, EveryLayout)
 
 TEST(SLKey, Compare)
 {
-    uint32_t one = 1, two = 2;
-    uint64_t big1 = 1, big2 = 2;
+    uint32_t one = 1, two = 2, big1[2] = {1, 0}, big2[2] = {2, 0};
     uint8_t abc[7] = {3, 0, 0, 0, 'a', 'b', 'c'}, abd[7] = {3, 0, 0, 0, 'a', 'b', 'd'};
     // Types: 1 counter, 5 integer, 6 64-bit integer, 7 octet string, 8 display string.
     auto key = [](uint32_t type, void* value, uint32_t id = 1) { return keyList({{id, type, value}}); };
@@ -213,7 +206,7 @@ TEST(SLKey, Compare)
         {"other integer", key(5, &one), key(5, &two), 0}, {"other counter", key(1, &one), key(1, &two), 0},
         {"other id", key(5, &one), key(5, &one, 2), 0}, {"one without value", key(5, nullptr), key(5, &one), 0},
         {"both without value", key(5, nullptr), key(5, nullptr), 1}, {"same string", key(8, abc), key(8, abc), 1},
-        {"other string", key(7, abc), key(7, abd), 0}, {"64-bit not compared", key(6, &big1), key(6, &big2), 1},
+        {"other string", key(7, abc), key(7, abd), 0}, {"64-bit not compared", key(6, big1), key(6, big2), 1},
         {"other count", key(5, &one), keyList({}), 0},
         {"eleven keys", keyList(std::vector<SLKeyEntry>(11)), keyList(std::vector<SLKeyEntry>(11)), 0}};
     for (auto& [name, a, b, equal] : rows)
@@ -235,10 +228,9 @@ TEST(SLMap, NameWalks)
                      }};
     };
     EXPECT_EQ(SLMapComponentNameToId("Board"), 12u) << "the exact name, not one with more bytes";
-    EXPECT_EQ(SLMapComponentNameToId("board"), 0u);
     repeat = true;
     EXPECT_EQ(SLMapComponentNameToId("Absent"), 0u);
-    EXPECT_EQ(p.blocks.size(), 3u + 4 + 2) << "the walk ends where the provider repeats itself";
+    EXPECT_EQ(p.blocks.size(), 3u + 2) << "the walk ends where the provider repeats itself";
     storeWord(SLCreateString(0), 1); // the smallest string holds a word
 }
 
@@ -294,11 +286,10 @@ TEST(SLEvent, Delivery)
     ScriptedProvider p;
     SLEventSetHandler(handler);
     for (uint32_t length : {51u, (1u << 20) + 1}) { // shorter than the header, above 1 MiB
-        int before = completions, handledBefore = handled;
+        int before = completions;
         std::vector<uint32_t> indication = event(length);
-        SLIndicationFunc(indication.data());
+        SLIndicationFunc(indication.data()); // a handled one would be completed later, by its event thread
         EXPECT_EQ(completions.load(), before + 1) << length;
-        EXPECT_EQ(handled.load(), handledBefore) << length;
     }
     auto expectWaits = [](std::atomic<int>& entered, const std::function<void()>& act) {
         hold = true;
