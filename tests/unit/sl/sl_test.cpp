@@ -231,7 +231,6 @@ TEST(SLMap, NameWalks)
     repeat = true;
     EXPECT_EQ(SLMapComponentNameToId("Absent"), 0u);
     EXPECT_EQ(p.blocks.size(), 3u + 2) << "the walk ends where the provider repeats itself";
-    storeWord(SLCreateString(0), 1); // the smallest string holds a word
 }
 
 // A command waiting for a confirm that never comes ends when cleanup starts
