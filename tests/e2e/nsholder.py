@@ -1,15 +1,15 @@
-"""Holds a private mount and network namespace for one testbed.
+# Holds a private mount and network namespace for one testbed.
+#
+# Run as `unshare -m -n -- python3 nsholder.py CONFIG.json` by testbed.py. It
+# brings the loopback interface up, lays the testbed's temporary tree over the
+# fixed paths the daemon uses, prints "ready" and then waits until its standard
+# input is closed. Every process of the testbed joins the namespaces with
+# nsenter; when the last of them ends, the namespaces go away with their mounts.
+#
+# Paths that do not exist on the host are made to exist inside the namespace
+# only: the nearest existing parent directory is covered by an overlay whose
+# upper layer lives in the temporary tree, so nothing on the host changes.
 
-Run as `unshare -m -n -- python3 nsholder.py CONFIG.json` by testbed.py. It
-brings the loopback interface up, lays the testbed's temporary tree over the
-fixed paths the daemon uses, prints "ready" and then waits until its standard
-input is closed. Every process of the testbed joins the namespaces with
-nsenter; when the last of them ends, the namespaces go away with their mounts.
-
-Paths that do not exist on the host are made to exist inside the namespace
-only: the nearest existing parent directory is covered by an overlay whose
-upper layer lives in the temporary tree, so nothing on the host changes.
-"""
 
 import json
 import os
@@ -27,7 +27,7 @@ class Layout:
         self.overlays = 0
 
     def ensure(self, path, directory):
-        """Makes `path` exist inside the namespace (a directory or a file)."""
+        # Makes `path` exist inside the namespace (a directory or a file).
         if os.path.exists(path):
             return
         if not path.startswith("/dev/"):  # /dev is a tmpfs of our own

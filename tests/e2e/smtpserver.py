@@ -1,17 +1,17 @@
-"""A small scripted SMTP server for the testbed.
+# A small scripted SMTP server for the testbed.
+#
+# Usage: smtpserver.py DIRECTORY [ADDRESS [PORT]]
+#
+# Listens on ADDRESS:PORT (127.0.0.1:25 inside the testbed's own network
+# namespace) and answers a plain SMTP dialogue: 220 greeting, 250 to HELO, MAIL
+# and RCPT, 354 to DATA, 250 after the end of data, 221 to QUIT. Nothing is
+# answered between DATA and the end of data, as a real server does. Each
+# session is written to DIRECTORY/session-N.json once the client has closed
+# the connection: the commands and data bytes received, in order, as text with
+# the bytes kept exactly (latin-1), each with its CLOCK_MONOTONIC arrival time. "DIRECTORY/ready" appears once listening.
+# A file DIRECTORY/replies.json may override the reply to a stage, e.g.
+# {"greeting": "421 busy"}.
 
-Usage: smtpserver.py DIRECTORY [ADDRESS [PORT]]
-
-Listens on ADDRESS:PORT (127.0.0.1:25 inside the testbed's own network
-namespace) and answers a plain SMTP dialogue: 220 greeting, 250 to HELO, MAIL
-and RCPT, 354 to DATA, 250 after the end of data, 221 to QUIT. Nothing is
-answered between DATA and the end of data, as a real server does. Each
-session is written to DIRECTORY/session-N.json once the client has closed
-the connection: the commands and data bytes received, in order, as text with
-the bytes kept exactly (latin-1), each with its CLOCK_MONOTONIC arrival time. "DIRECTORY/ready" appears once listening.
-A file DIRECTORY/replies.json may override the reply to a stage, e.g.
-{"greeting": "421 busy"}.
-"""
 
 import json
 import os

@@ -1,6 +1,7 @@
-"""Events whose actions reach beyond the daemon: an e-mail alert delivered to a
-real SMTP server, the notifications-only configuration keeping the machine
-untouched, and the operating-system shutdown through /sbin/init."""
+# Events whose actions reach beyond the daemon: an e-mail alert delivered to a
+# real SMTP server, the notifications-only configuration keeping the machine
+# untouched, and the operating-system shutdown through /sbin/init.
+
 
 import email
 import email.policy

@@ -1,8 +1,9 @@
-"""Events through the real daemon: raised by the substitute provider, matched in
-the daemon's actions tables, and carried out on every channel a person or the
-machine sees (standard error and output, system log, alarm peer, e-mail, the
-baseboard's LCD, paging and ID-LED groups, the simulated management
-controller)."""
+# Events through the real daemon: raised by the substitute provider, matched in
+# the daemon's actions tables, and carried out on every channel a person or the
+# machine sees (standard error and output, system log, alarm peer, e-mail, the
+# baseboard's LCD, paging and ID-LED groups, the simulated management
+# controller).
+
 
 import os
 import shutil
@@ -37,12 +38,12 @@ def keys(values):
 
 
 def alarm(component, group, event_group, severity, instance, power):
-    """The 28-byte record the daemon writes to the alarm peer, as kobd prints it."""
+    # The 28-byte record the daemon writes to the alarm peer, as kobd prints it.
     return struct.pack("<B3xIIIIIB3x", 1, component, group, event_group, severity, instance, power).hex()
 
 
 def listening(pid, port, timeout):
-    """True once a TCP socket of the network namespace of `pid` listens on `port`."""
+    # True once a TCP socket of the network namespace of `pid` listens on `port`.
     deadline = time.monotonic() + timeout
     while time.monotonic() < deadline:
         try:
@@ -58,12 +59,12 @@ def listening(pid, port, timeout):
 
 
 class Sampler:
-    """Samples the baseboard groups the actions write (LCD, paging, ID LED)
-    and the simulated controller's log while a scenario runs, with times.
-
-    The controller's log is tailed every 20 ms on a thread of its own, so a
-    line's time is at most that late; a sample of the groups is stamped once
-    its values have been read, so its values were there at its time."""
+    # Samples the baseboard groups the actions write (LCD, paging, ID LED)
+    # and the simulated controller's log while a scenario runs, with times.
+    #
+    # The controller's log is tailed every 20 ms on a thread of its own, so a
+    # line's time is at most that late; a sample of the groups is stamped once
+    # its values have been read, so its values were there at its time.
 
     def __init__(self, bed, baseboard, period=0.2):
         self.bed, self.baseboard, self.period = bed, baseboard, period
@@ -110,17 +111,17 @@ class Sampler:
 
 
 class EventBedCase(BedTestCase):
-    """Helpers of the event scenarios: a daemon beside the sample baseboard."""
+    # Helpers of the event scenarios: a daemon beside the sample baseboard.
 
     def setUp(self):
         require("MOX_DMICTL", "the provider's client tool")
 
     def event_bed(self, name, config=None, email=None, kobd=False, extra_components=(), vendor_rows=(),
                   merge=False):
-        """A running daemon with the sample baseboard installed; returns the
-        bed, the daemon, the component ids and the alarm peer (or None).
-        `vendor_rows` are added to the vendor actions table of the bed's copy
-        of mox.mif before the daemon installs it."""
+        # A running daemon with the sample baseboard installed; returns the
+        # bed, the daemon, the component ids and the alarm peer (or None).
+        # `vendor_rows` are added to the vendor actions table of the bed's copy
+        # of mox.mif before the daemon installs it.
         bed = self.bed(name)
         if vendor_rows:
             path = os.path.join(bed.paths["mifs"], "mox.mif")
@@ -147,8 +148,8 @@ class EventBedCase(BedTestCase):
         return bed, mox, ids, peer
 
     def critical_temperature(self, bed, ids, switches):
-        """Makes the baseboard's temperature event critical and switches the
-        given actions on in its actions row (an administrator's change)."""
+        # Makes the baseboard's temperature event critical and switches the
+        # given actions on in its actions row (an administrator's change).
         bed.dmictl("set", ids["baseboard"], 20, 1, "3")   # Temperature Critical
         bed.dmictl("set", ids["baseboard"], 20, 2, "16")  # severity Critical
         for attribute in switches:

@@ -1,6 +1,7 @@
-"""Registration of the real daemon with the substitute DMI provider: its own MIF
-installed into an empty database, refusal, a missing MIF, and the carry-over of
-an older MIF's actions table."""
+# Registration of the real daemon with the substitute DMI provider: its own MIF
+# installed into an empty database, refusal, a missing MIF, and the carry-over of
+# an older MIF's actions table.
+
 
 import fcntl
 import os
@@ -160,7 +161,7 @@ class RegistrationTest(BedTestCase):
 
     @staticmethod
     def current_mox(bed):
-        """The own component's id once its version reads 2.93, else None."""
+        # The own component's id once its version reads 2.93, else None.
         code, out, _ = bed.dmictl("list", check=False)
         for line in out.splitlines() if code == 0 else []:
             cid, _, name = line.partition("\t")

@@ -1,4 +1,5 @@
-"""Start-up of the real daemon: the marker files, the floppy probe, its lines."""
+# Start-up of the real daemon: the marker files, the floppy probe, its lines.
+
 
 import os
 import time
@@ -15,7 +16,7 @@ UMOUNT = "umount /mnt/floppy"
 
 
 def log_sequence(bed):
-    """The daemon's lines and the stub mount/umount calls, in arrival order."""
+    # The daemon's lines and the stub mount/umount calls, in arrival order.
     return [(e.tag, e.message) for e in bed.log.snapshot() if e.tag in ("mox", "stub")]
 
 
