@@ -22,16 +22,8 @@ def log_sequence(bed):
 
 class StartupTest(BedTestCase):
 
-    @classmethod
-    def setUpClass(cls):
-        # Say how the floppy is stood in for: always by the stub mount and
-        # umount commands of the testbed, which make a medium's files appear
-        # in /mnt/floppy. A real FAT image could only be mounted by a kernel
-        # with the msdos filesystem.
-        with open("/proc/filesystems") as f:
-            kernel = f.read().split()
-        print("floppy: stub mount/umount on PATH; this kernel %s the msdos filesystem"
-              % ("has" if "msdos" in kernel else "lacks"))
+    # The floppy is stood in for by the testbed's stub mount and umount
+    # commands, which make a medium's files appear in /mnt/floppy.
 
     def test_start_without_markers_or_floppy(self):
         bed = self.bed("plain")

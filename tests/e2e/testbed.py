@@ -62,11 +62,8 @@ def require(name, what):
 
 
 class LogEntry:
-    def __init__(self, raw, arrival, sequence):
-        self.raw = raw
-        self.arrival = arrival
-        self.sequence = sequence
-        text = raw.decode("latin-1")
+    def __init__(self, raw, arrival):
+        self.raw, self.arrival, text = raw, arrival, raw.decode("latin-1")
         match = _SYSLOG_LINE.match(text)
         self.priority, self.tag, self.pid, self.message = None, None, None, text
         if match:
@@ -88,8 +85,7 @@ class SyslogReceiver:
         os.chmod(path, 0o666)
         self.entries = []
         self.cond = threading.Condition()
-        self.thread = threading.Thread(target=self._run, daemon=True)
-        self.thread.start()
+        threading.Thread(target=self._run, daemon=True).start()
 
     def _run(self):
         while True:
@@ -98,7 +94,7 @@ class SyslogReceiver:
             except OSError:
                 return
             with self.cond:
-                self.entries.append(LogEntry(raw, time.monotonic(), len(self.entries)))
+                self.entries.append(LogEntry(raw, time.monotonic()))
                 self.cond.notify_all()
 
     def close(self):
@@ -109,8 +105,7 @@ class SyslogReceiver:
         self.sock.close()
 
     def snapshot(self, tag=None):
-        with self.cond:
-            return [e for e in self.entries if tag is None or e.tag == tag]
+        return self.since(0, tag)
 
     def mark(self):
         # A position in the log, for since() and wait_for(start=...).
@@ -125,30 +120,19 @@ class SyslogReceiver:
     def wait_for(self, message, timeout, tag="mox", start=0):
         # The first entry from `start` on whose message equals `message` (a
         # string) or satisfies it (a callable); None when none came in time.
-        deadline = time.monotonic() + timeout
         test = message if callable(message) else (lambda m: m == message)
+        find = lambda: next((e for e in self.entries[start:] if (tag is None or e.tag == tag) and test(e.message)), None)
         with self.cond:
-            while True:
-                for e in self.entries[start:]:
-                    if (tag is None or e.tag == tag) and test(e.message):
-                        return e
-                left = deadline - time.monotonic()
-                if left <= 0:
-                    return None
-                self.cond.wait(left)
+            return self.cond.wait_for(find, timeout)
 
 
 class Stream:
     # Collects what a process writes to one pipe, with arrival times.
 
     def __init__(self, pipe):
-        self.pipe = pipe
-        self.data = b""
-        self.first_arrival = None
+        self.pipe, self.data, self.first_arrival, self.eof = pipe, b"", None, False
         self.cond = threading.Condition()
-        self.eof = False
-        self.thread = threading.Thread(target=self._run, daemon=True)
-        self.thread.start()
+        threading.Thread(target=self._run, daemon=True).start()
 
     def _run(self):
         while True:
@@ -186,15 +170,13 @@ class Process:
         self.pid = self.popen.pid
         self.stdout = Stream(self.popen.stdout)
         self.stderr = self.stdout if merge else Stream(self.popen.stderr)
-        self.ended = None
-        self.status = None
+        self.ended = self.status = None
         self._done = threading.Event()
         threading.Thread(target=self._wait, daemon=True).start()
 
     def _wait(self):
-        status = self.popen.wait()
+        self.status = self.popen.wait()
         self.ended = time.monotonic()
-        self.status = status
         self._done.set()
 
     def wait(self, timeout):
