@@ -12,6 +12,7 @@ import struct
 import tempfile
 import time
 
+import testbed
 from testbed import LOG_EMERG, LOG_ERR, LOG_INFO, LOG_WARNING, BedTestCase, require
 
 MOX_COMPONENT = "Zorek Tessarin Server Manager - Mox"
@@ -45,14 +46,9 @@ def listening(pid, port, timeout):
     # True once a TCP socket of the network namespace of `pid` listens on `port`.
     deadline = time.monotonic() + timeout
     while time.monotonic() < deadline:
-        try:
-            with open("/proc/%d/net/tcp" % pid) as f:
-                for line in f.readlines()[1:]:
-                    fields = line.split()
-                    if fields[1].endswith(":%04X" % port) and fields[3] == "0A":
-                        return True
-        except OSError:
-            return False
+        with open("/proc/%d/net/tcp" % pid) as f:
+            if any(l.split()[1].endswith(":%04X" % port) and l.split()[3] == "0A" for l in f.readlines()[1:]):
+                return True
         time.sleep(0.05)
     return False
 
@@ -204,12 +200,8 @@ class EventTest(EventBedCase):
         # go on.
         kobd = require("MOX_KOBD", "the alarm peer kobd")
         bed, mox, ids, _ = self.event_bed("stale")
-        peer = bed.spawn([kobd])
         lock, fifo = os.path.join(bed.paths["run"], "kobLock"), "/dev/kob"
-        deadline = time.monotonic() + 10
-        while not os.path.exists(lock) and time.monotonic() < deadline:
-            time.sleep(0.02)
-        self.assertTrue(os.path.exists(lock), peer.stderr.data)
+        peer = testbed._started(bed.spawn([kobd]), lock, "kobd")
         self.assertEqual(bed.run(["test", "-p", fifo]).returncode, 0)
         start = bed.log.mark()
         bed.dmictl("vendor-event", ids["baseboard"], 10)

@@ -235,17 +235,12 @@ class Testbed:
         # "stub", so its order among the daemon's own lines can be checked.
         mount = """#!/bin/sh
 logger -u /dev/log -t stub "mount $*" 2>/dev/null
-if [ -d '%s' ]; then
-  cp -a '%s'/. '%s'/ && exit 0
-  exit 32
-fi
-echo "mount: %s: no medium found on /dev/fd0." >&2
-exit 32
-""" % (medium, medium, floppy, floppy)
+[ -d '%s' ] || { echo "mount: %s: no medium found on /dev/fd0." >&2; exit 32; }
+cp -a '%s'/. '%s'/ || exit 32
+""" % (medium, floppy, medium, floppy)
         umount = """#!/bin/sh
 logger -u /dev/log -t stub "umount $*" 2>/dev/null
-find '%s' -mindepth 1 -delete
-exit 0
+find '%s' -mindepth 1 -delete; exit 0
 """ % floppy
         for name, text in (("mount", mount), ("umount", umount)):
             path = os.path.join(self.paths["stubs"], name)
