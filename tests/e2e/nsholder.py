@@ -10,7 +10,6 @@
 # only: the nearest existing parent directory is covered by an overlay whose
 # upper layer lives in the temporary tree, so nothing on the host changes.
 
-
 import json
 import os
 import subprocess

@@ -5,7 +5,6 @@
 # that could not get its namespaces shows as skipped, never as passed. Skipped
 # tests are listed with their reasons either way.
 
-
 import os
 import sys
 import time

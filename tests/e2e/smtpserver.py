@@ -13,7 +13,6 @@
 # A file DIRECTORY/replies.json may override the reply to a stage, e.g.
 # {"greeting": "421 busy"}.
 
-
 import json
 import os
 import socket

@@ -2,7 +2,6 @@
 # real SMTP server, the notifications-only configuration keeping the machine
 # untouched, and the operating-system shutdown through /sbin/init.
 
-
 import email
 import email.policy
 import os

@@ -4,7 +4,6 @@
 # baseboard's LCD, paging and ID-LED groups, the simulated management
 # controller).
 
-
 import os
 import shutil
 import socket

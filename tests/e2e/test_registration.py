@@ -2,7 +2,6 @@
 # installed into an empty database, refusal, a missing MIF, and the carry-over of
 # an older MIF's actions table.
 
-
 import fcntl
 import os
 import shutil
@@ -102,9 +101,12 @@ class RegistrationTest(BedTestCase):
                 shutil.copy(os.path.join(bed.paths["mifs"], "old", "mox-%s.mif" % version), old_file)
                 old_id = int(bed.dmictl("install", old_file))
                 key_ids = self.key_ids(bed, old_id, old_group)
-                # An administrator's change, to a value no default has.
+                # An administrator's change, to values no default has (2.40's
+                # enable flag, attribute 6, is attribute 30 now).
                 first = bed.table(old_id, old_group)[0]
-                bed.dmictl("set", old_id, old_group, 7, "7", *[a for k in key_ids for a in ("-k", first[k])])
+                for attribute in (7, 6) if old_group == 3 else (7,):
+                    bed.dmictl("set", old_id, old_group, attribute, str(attribute),
+                               *[a for k in key_ids for a in ("-k", first[k])])
                 # (new keys, attribute) -> value; the enable flag of 2.40 was
                 # attribute 6.
                 expected = {}
@@ -133,6 +135,8 @@ class RegistrationTest(BedTestCase):
                 wait_until(lambda: carried() == {k: expected[k] for k in carried()}, 10)
                 got = carried()
                 self.assertIn(changed, got, version)
+                if old_group == 3:
+                    self.assertEqual(got[(changed[0], 30)], "6", version)
                 self.assertEqual(got, {k: expected[k] for k in got}, version)
                 self.assertIsNone(bed.log.wait_for(INSTALLED, 0), version)
                 table = bed.table(new_id, new_group)

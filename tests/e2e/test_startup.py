@@ -1,6 +1,5 @@
 # Start-up of the real daemon: the marker files, the floppy probe, its lines.
 
-
 import os
 import time
 

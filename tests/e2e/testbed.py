@@ -24,7 +24,6 @@
 # CMakeLists.txt): MOX_BIN, MOX_SOURCE_DIR, MOX_INIT_STUB and, once built,
 # MOX_OBX_PRELOAD, MOX_KOBD, MOX_DMISP_TOOL.
 
-
 import json
 import os
 import re
