@@ -7,7 +7,7 @@ import os
 import shutil
 import time
 
-from testbed import LOG_ERR, LOG_INFO, BedTestCase, require, run_in_parallel
+from testbed import LOG_ERR, LOG_INFO, BedTestCase, require, run_in_parallel, wait_until
 
 MOX_COMPONENT = "Zorek Tessarin Server Manager - Mox"
 START_LINES = ("Checking for mox configurations ..\n"
@@ -17,15 +17,6 @@ INSTALLED = "MOX - installed mox.mif\n"
 # Integer attributes of an actions-table row that the carry-over keeps:
 # the action switches (17 is the alert name, a string) and the enable flag.
 SWITCHES = [a for a in range(7, 23) if a != 17] + [30]
-
-
-def wait_until(condition, timeout, step=0.1):
-    deadline = time.monotonic() + timeout
-    while True:
-        value = condition()
-        if value or time.monotonic() > deadline:
-            return value
-        time.sleep(step)
 
 
 class RegistrationTest(BedTestCase):

@@ -24,6 +24,7 @@
 # CMakeLists.txt): MOX_BIN, MOX_SOURCE_DIR, MOX_INIT_STUB and, once built,
 # MOX_OBX_PRELOAD, MOX_KOBD, MOX_DMISP_TOOL.
 
+import contextlib
 import json
 import os
 import re
@@ -97,10 +98,8 @@ class SyslogReceiver:
                 self.cond.notify_all()
 
     def close(self):
-        try:
+        with contextlib.suppress(OSError):
             self.sock.shutdown(socket.SHUT_RDWR)
-        except OSError:
-            pass
         self.sock.close()
 
     def snapshot(self, tag=None):
@@ -413,22 +412,17 @@ find '%s' -mindepth 1 -delete; exit 0
 
     def smtp_sessions(self, count, timeout):
         # The first `count` finished SMTP sessions (fewer if they did not come).
-        deadline = time.monotonic() + timeout
-        while True:
-            names = sorted(n for n in os.listdir(self.paths["smtp"])
-                           if n.startswith("session-") and n.endswith(".json"))
-            if len(names) >= count or time.monotonic() > deadline:
-                return [json.load(open(os.path.join(self.paths["smtp"], n))) for n in names]
-            time.sleep(0.05)
+        def names():
+            return sorted(n for n in os.listdir(self.paths["smtp"]) if n.startswith("session-") and n.endswith(".json"))
+        wait_until(lambda: len(names()) >= count, timeout, 0.05)
+        return [json.load(open(os.path.join(self.paths["smtp"], n))) for n in names()]
 
     def close(self):
         for process in self.processes:
             process.kill()
         if self.holder is not None:
-            try:
+            with contextlib.suppress(OSError):
                 self.holder.stdin.close()
-            except OSError:
-                pass
             try:
                 self.holder.wait(10)
             except subprocess.TimeoutExpired:
@@ -459,13 +453,20 @@ class BedTestCase(unittest.TestCase):
         return entry
 
 
+def wait_until(condition, timeout, step=0.1):
+    # The first true value of condition(), or its last value after `timeout`.
+    deadline = time.monotonic() + timeout
+    while True:
+        value = condition()
+        if value or time.monotonic() > deadline:
+            return value
+        time.sleep(step)
+
+
 def _started(process, path, what):
     # The process once `path` exists (its sign of being ready).
-    deadline = time.monotonic() + 20
-    while not os.path.exists(path):
-        if time.monotonic() > deadline or not process.running():
-            raise RuntimeError("%s did not start: %r" % (what, process.stderr.data))
-        time.sleep(0.02)
+    if not wait_until(lambda: os.path.exists(path) or not process.running(), 20, 0.02) or not process.running():
+        raise RuntimeError("%s did not start: %r" % (what, process.stderr.data))
     return process
 
 
