@@ -1,15 +1,14 @@
-"""Holds a private mount and network namespace for one testbed.
-
-Run as `unshare -m -n -- python3 nsholder.py CONFIG.json` by testbed.py. It
-brings the loopback interface up, lays the testbed's temporary tree over the
-fixed paths the daemon uses, prints "ready" and then waits until its standard
-input is closed. Every process of the testbed joins the namespaces with
-nsenter; when the last of them ends, the namespaces go away with their mounts.
-
-Paths that do not exist on the host are made to exist inside the namespace
-only: the nearest existing parent directory is covered by an overlay whose
-upper layer lives in the temporary tree, so nothing on the host changes.
-"""
+# Holds a private mount and network namespace for one testbed.
+#
+# Run as `unshare -m -n -- python3 nsholder.py CONFIG.json` by testbed.py. It
+# brings the loopback interface up, lays the testbed's temporary tree over the
+# fixed paths the daemon uses, prints "ready" and then waits until its standard
+# input is closed. Every process of the testbed joins the namespaces with
+# nsenter; when the last of them ends, the namespaces go away with their mounts.
+#
+# Paths that do not exist on the host are made to exist inside the namespace
+# only: the nearest existing parent directory is covered by an overlay whose
+# upper layer lives in the temporary tree, so nothing on the host changes.
 
 import json
 import os
@@ -21,39 +20,31 @@ def run(*args):
     subprocess.run(args, check=True, stdout=subprocess.DEVNULL, stderr=subprocess.PIPE)
 
 
-class Layout:
-    def __init__(self, scratch):
-        self.scratch = scratch
-        self.overlays = 0
-
-    def ensure(self, path, directory):
-        """Makes `path` exist inside the namespace (a directory or a file)."""
-        if os.path.exists(path):
-            return
-        if not path.startswith("/dev/"):  # /dev is a tmpfs of our own
-            parent = os.path.dirname(path)
-            while not os.path.isdir(parent):
-                parent = os.path.dirname(parent)
-            parent = os.path.realpath(parent)
-            if parent == "/":
-                raise RuntimeError("refusing to cover / to create " + path)
-            self.overlays += 1
-            layer = os.path.join(self.scratch, "overlay%d" % self.overlays)
-            os.makedirs(layer + "/upper")
-            os.makedirs(layer + "/work")
-            run("mount", "-t", "overlay", "overlay", "-o",
-                "lowerdir=%s,upperdir=%s/upper,workdir=%s/work" % (parent, layer, layer), parent)
-        if directory:
-            os.makedirs(path, exist_ok=True)
-        else:
-            os.makedirs(os.path.dirname(path), exist_ok=True)
-            open(path, "a").close()
+def ensure(scratch, number, path, directory):
+    # Makes `path` exist inside the namespace (a directory or a file), under
+    # overlay `number` when the host lacks it.
+    if os.path.exists(path):
+        return
+    if not path.startswith("/dev/"):  # /dev is a tmpfs of our own
+        parent = os.path.dirname(path)
+        while not os.path.isdir(parent):
+            parent = os.path.dirname(parent)
+        parent = os.path.realpath(parent)
+        if parent == "/":
+            raise RuntimeError("refusing to cover / to create " + path)
+        layer = os.path.join(scratch, "overlay%d" % number)
+        os.makedirs(layer + "/upper")
+        os.makedirs(layer + "/work")
+        run("mount", "-t", "overlay", "overlay", "-o",
+            "lowerdir=%s,upperdir=%s/upper,workdir=%s/work" % (parent, layer, layer), parent)
+    os.makedirs(path if directory else os.path.dirname(path), exist_ok=True)
+    if not directory:
+        open(path, "a").close()
 
 
 def main():
     with open(sys.argv[1]) as f:
         config = json.load(f)
-    layout = Layout(config["scratch"])
     run("ip", "link", "set", "lo", "up")
 
     # /dev: a tmpfs of our own, so that /dev/kob and /dev/log are the
@@ -73,8 +64,8 @@ def main():
     run("mount", "-t", "tmpfs", "tmpfs", "/dev/shm")
     run("umount", hostdev)
 
-    for source, target in config["binds"]:
-        layout.ensure(target, os.path.isdir(source))
+    for number, (source, target) in enumerate(config["binds"]):
+        ensure(config["scratch"], number, target, os.path.isdir(source))
         run("mount", "--bind", source, target)
 
     sys.stdout.write("ready\n")
@@ -85,11 +76,8 @@ def main():
 if __name__ == "__main__":
     try:
         main()
-    except subprocess.CalledProcessError as e:
-        sys.stdout.write("failed: %s: %s\n" % (" ".join(e.cmd), e.stderr.decode(errors="replace").strip()))
-        sys.stdout.flush()
-        sys.exit(1)
     except Exception as e:  # reported to the testbed, which fails the test
-        sys.stdout.write("failed: %r\n" % (e,))
+        detail = e.stderr.decode(errors="replace").strip() if isinstance(e, subprocess.CalledProcessError) else ""
+        sys.stdout.write("failed: %r %s\n" % (e, detail))
         sys.stdout.flush()
         sys.exit(1)

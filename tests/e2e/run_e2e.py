@@ -1,10 +1,9 @@
-"""Runs one end-to-end test module for CTest.
-
-Exit status: 0 when every test that ran passed, 1 on any failure or error,
-77 (CTest's SKIP_RETURN_CODE) when every test was skipped, so that a testbed
-that could not get its namespaces shows as skipped, never as passed. Skipped
-tests are listed with their reasons either way.
-"""
+# Runs one end-to-end test module for CTest.
+#
+# Exit status: 0 when every test that ran passed, 1 on any failure or error,
+# 77 (CTest's SKIP_RETURN_CODE) when every test was skipped, so that a testbed
+# that could not get its namespaces shows as skipped, never as passed. Skipped
+# tests are listed with their reasons either way.
 
 import os
 import sys

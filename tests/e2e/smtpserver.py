@@ -1,17 +1,17 @@
-"""A small scripted SMTP server for the testbed.
-
-Usage: smtpserver.py DIRECTORY [ADDRESS [PORT]]
-
-Listens on ADDRESS:PORT (127.0.0.1:25 inside the testbed's own network
-namespace) and answers a plain SMTP dialogue: 220 greeting, 250 to HELO, MAIL
-and RCPT, 354 to DATA, 250 after the end of data, 221 to QUIT. Nothing is
-answered between DATA and the end of data, as a real server does. Each
-session is written to DIRECTORY/session-N.json once the client has closed
-the connection: the commands and data bytes received, in order, as text with
-the bytes kept exactly (latin-1), each with its CLOCK_MONOTONIC arrival time. "DIRECTORY/ready" appears once listening.
-A file DIRECTORY/replies.json may override the reply to a stage, e.g.
-{"greeting": "421 busy"}.
-"""
+# A small scripted SMTP server for the testbed.
+#
+# Usage: smtpserver.py DIRECTORY
+#
+# Listens on 127.0.0.1:25 (inside the testbed's own network namespace) and
+# answers a plain SMTP dialogue: 220 greeting, 250 to HELO, MAIL and RCPT, 354
+# to DATA, 250 after the end of data, 221 to QUIT. Nothing is answered between
+# DATA and the end of data, as a real server does. Each session is written to
+# DIRECTORY/session-N.json once the client has closed the connection: the
+# commands and data bytes received, in order, as text with the bytes kept
+# exactly (latin-1), each with its CLOCK_MONOTONIC arrival time.
+# "DIRECTORY/ready" appears once listening.
+# A file DIRECTORY/replies.json may override the reply to a stage, e.g.
+# {"greeting": "421 busy"}.
 
 import json
 import os
@@ -19,6 +19,10 @@ import socket
 import sys
 import threading
 import time
+
+# verb -> (stage, default reply)
+ANSWERS = {"HELO": ("helo", "250 testbed"), "EHLO": ("helo", "250 testbed"), "MAIL": ("mail", "250 sender ok"),
+           "RCPT": ("rcpt", "250 recipient ok"), "DATA": ("data", "354 go ahead"), "QUIT": ("quit", "221 bye")}
 
 
 def serve(conn, directory, number, replies):
@@ -55,19 +59,8 @@ def serve(conn, directory, number, replies):
                 buffer = buffer[end + 2:]
                 record["commands"].append({"received": line, "at": time.monotonic()})
                 verb = line.split(" ", 1)[0].split(":", 1)[0].upper()
-                if verb in ("HELO", "EHLO"):
-                    reply("helo", "250 testbed")
-                elif verb == "MAIL":
-                    reply("mail", "250 sender ok")
-                elif verb == "RCPT":
-                    reply("rcpt", "250 recipient ok")
-                elif verb == "DATA":
-                    reply("data", "354 go ahead")
-                    in_data = True
-                elif verb == "QUIT":
-                    reply("quit", "221 bye")
-                else:
-                    reply("unknown", "500 unknown command")
+                reply(*ANSWERS.get(verb, ("unknown", "500 unknown command")))
+                in_data = verb == "DATA"
     except OSError as e:
         record["error"] = str(e)
     finally:
@@ -81,17 +74,11 @@ def serve(conn, directory, number, replies):
 
 def main():
     directory = sys.argv[1]
-    address = sys.argv[2] if len(sys.argv) > 2 else "127.0.0.1"
-    port = int(sys.argv[3]) if len(sys.argv) > 3 else 25
-    replies = {}
-    try:
-        with open(os.path.join(directory, "replies.json")) as f:
-            replies = json.load(f)
-    except FileNotFoundError:
-        pass
+    replies_path = os.path.join(directory, "replies.json")
+    replies = json.load(open(replies_path)) if os.path.exists(replies_path) else {}
     listener = socket.socket(socket.AF_INET, socket.SOCK_STREAM)
     listener.setsockopt(socket.SOL_SOCKET, socket.SO_REUSEADDR, 1)
-    listener.bind((address, port))
+    listener.bind(("127.0.0.1", 25))
     listener.listen(8)
     open(os.path.join(directory, "ready"), "w").close()
     number = 0

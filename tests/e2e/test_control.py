@@ -1,6 +1,6 @@
-"""Events whose actions reach beyond the daemon: an e-mail alert delivered to a
-real SMTP server, the notifications-only configuration keeping the machine
-untouched, and the operating-system shutdown through /sbin/init."""
+# Events whose actions reach beyond the daemon: an e-mail alert delivered to a
+# real SMTP server, the notifications-only configuration keeping the machine
+# untouched, and the operating-system shutdown through /sbin/init.
 
 import email
 import email.policy
@@ -30,12 +30,9 @@ class ControlTest(EventBedCase):
         self.assertTrue(listening(server.pid, 25, 10), server.stderr.data)
         self.critical_temperature(bed, ids, [])  # its row sends e-mail as installed
         self.raise_temperature(bed, ids)
-        deadline = time.monotonic() + 20
-        messages = []
-        while not messages and time.monotonic() < deadline:
-            time.sleep(0.2)
-            new = os.path.join(maildir, "new")
-            messages = [os.path.join(new, n) for n in os.listdir(new)] if os.path.isdir(new) else []
+        new = os.path.join(maildir, "new")
+        messages = testbed.wait_until(lambda: [os.path.join(new, n) for n in os.listdir(new)]
+                                      if os.path.isdir(new) else [], 20, 0.2)
         self.assertEqual(len(messages), 1, "no mail stored; stderr %r" % mox.stderr.data)
         with open(messages[0], "rb") as f:
             message = email.message_from_binary_file(f, policy=email.policy.compat32)

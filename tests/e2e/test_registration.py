@@ -1,15 +1,13 @@
-"""Registration of the real daemon with the substitute DMI provider: its own MIF
-installed into an empty database, refusal, a missing MIF, and the carry-over of
-an older MIF's actions table."""
+# Registration of the real daemon with the substitute DMI provider: its own MIF
+# installed into an empty database, refusal, a missing MIF, and the carry-over of
+# an older MIF's actions table.
 
 import fcntl
 import os
 import shutil
-import subprocess
-import tempfile
 import time
 
-from testbed import LOG_ERR, LOG_INFO, BedTestCase, require, run_in_parallel
+from testbed import LOG_ERR, LOG_INFO, BedTestCase, require, run_in_parallel, wait_until
 
 MOX_COMPONENT = "Zorek Tessarin Server Manager - Mox"
 START_LINES = ("Checking for mox configurations ..\n"
@@ -19,15 +17,6 @@ INSTALLED = "MOX - installed mox.mif\n"
 # Integer attributes of an actions-table row that the carry-over keeps:
 # the action switches (17 is the alert name, a string) and the enable flag.
 SWITCHES = [a for a in range(7, 23) if a != 17] + [30]
-
-
-def wait_until(condition, timeout, step=0.1):
-    deadline = time.monotonic() + timeout
-    while True:
-        value = condition()
-        if value or time.monotonic() > deadline:
-            return value
-        time.sleep(step)
 
 
 class RegistrationTest(BedTestCase):
@@ -42,24 +31,25 @@ class RegistrationTest(BedTestCase):
         time.sleep(1.0)
         self.assertTrue(mox.running(), "status %s, stderr %r" % (mox.status, mox.stderr.data))
         self.assertEqual(mox.stdout.data.decode(), START_LINES)
-        component = bed.component_id(MOX_COMPONENT)
+        component = self.current_mox(bed)
         self.assertIsNotNone(component, bed.dmictl("list"))
-        self.assertEqual(bed.dmictl("get", component, 1, 3), "2.93\n")
         # The daemon registered once with the provider that serves it.
         self.assertIn("registrations\t1\n", bed.dmictl("status"))
         mox.kill()
+        before = len(bed.log.snapshot("mox"))
+        self.second_start(bed, component)
+        self.assertEqual([e.message for e in bed.log.snapshot("mox")[before:]],
+                         ["\n" + START_LINES.splitlines(True)[0]] + START_LINES.splitlines(True)[1:])
 
+    def second_start(self, bed, component):
         # A second start finds the MIF current: nothing installed, nothing
         # migrated (a migration reinstalls and so changes the component id).
-        before = bed.log.snapshot("mox")
         again = bed.start_mox()
         self.assertTrue(again.stdout.wait_for(b"Proceeding with loading mox ..\n", 10))
         self.assertTrue(wait_until(lambda: "registrations\t1\n" in bed.dmictl("status", check=False)[1], 10))
         time.sleep(1.0)
         self.assertTrue(again.running(), again.stderr.data)
-        self.assertEqual(bed.component_id(MOX_COMPONENT), component)
-        self.assertEqual([e.message for e in bed.log.snapshot("mox")[len(before):]],
-                         ["\n" + START_LINES.splitlines(True)[0]] + START_LINES.splitlines(True)[1:])
+        self.assertEqual(self.current_mox(bed), component)
         again.kill()
 
     def test_initialisation_failures(self):
@@ -92,75 +82,65 @@ class RegistrationTest(BedTestCase):
 
     def test_carry_over_of_older_actions_tables(self):
         # version -> (table group in the old MIF, group written in the new,
-        #             keys of the old rows mapped to those of the new)
-        cases = {
-            "2.40": (3, 4, lambda keys: keys + ["0"]),
-            "2.60": (4, 4, lambda keys: keys),
-            "2.92": (10, 10, lambda keys: keys),
-        }
-        # The tables of a freshly installed current MIF, the defaults.
-        defaults = self.fresh_tables()
+        #             keys added to the old rows' to give the new rows')
+        cases = {"2.40": (3, 4, ["0"]), "2.60": (4, 4, []), "2.92": (10, 10, [])}
 
-        def case(version, old_group, new_group, new_keys):
+        def case(version, old_group, new_group, added_keys):
             def check():
                 bed = self.bed("carry")
                 old_file = os.path.join(bed.paths["scratch"], "mox-%s.mif" % version)
                 shutil.copy(os.path.join(bed.paths["mifs"], "old", "mox-%s.mif" % version), old_file)
                 old_id = int(bed.dmictl("install", old_file))
-                old_rows = bed.table(old_id, old_group)
-                self.assertTrue(old_rows, version)
-                # An administrator's change in the old table must survive too.
-                first = old_rows[0]
                 key_ids = self.key_ids(bed, old_id, old_group)
-                keys = [arg for k in key_ids for arg in ("-k", first[k])]
-                bed.dmictl("set", old_id, old_group, 7, "7", *keys)
-                old_rows = bed.table(old_id, old_group)
+                # An administrator's change, to values no default has (2.40's
+                # enable flag, attribute 6, is attribute 30 now).
+                first = bed.table(old_id, old_group)[0]
+                for attribute in (7, 6) if old_group == 3 else (7,):
+                    bed.dmictl("set", old_id, old_group, attribute, str(attribute),
+                               *[a for k in key_ids for a in ("-k", first[k])])
+                # (new keys, attribute) -> value; the enable flag of 2.40 was
+                # attribute 6.
+                expected = {}
+                for old in bed.table(old_id, old_group):
+                    for a in SWITCHES:
+                        source = 6 if (a == 30 and old_group == 3) else a
+                        if source in old:
+                            expected[(tuple([old[k] for k in key_ids] + added_keys), a)] = old[source]
+                changed = (tuple([first[k] for k in key_ids] + added_keys), 7)
+                self.assertEqual(expected[changed], "7", version)
 
                 mox = bed.start_mox()
                 new_id = wait_until(lambda: self.current_mox(bed), 15)
                 self.assertTrue(new_id, "%s: mox.mif 2.93 never appeared; %s" % (version, mox.stderr.data))
                 self.assertNotEqual(new_id, old_id, version)
                 self.assertEqual(len(bed.dmictl("list").splitlines()), 1, version)
-
-                expected = [dict(row) for row in defaults[new_group]]
                 new_key_ids = self.key_ids(bed, new_id, new_group)
-                for old in old_rows:
-                    mapped = new_keys([old[k] for k in key_ids])
-                    for row in expected:
-                        if [row[k] for k in new_key_ids] == mapped:
-                            for a in SWITCHES:
-                                source = 6 if (a == 30 and old_group == 3) else a
-                                if source in old:
-                                    row[a] = old[source]
-                            break
-                # The old table differs from the new defaults (at least by the
-                # change made above), so the check below can tell.
-                self.assertNotEqual(expected, defaults[new_group], version)
-                # The write-back follows the reinstall; let it finish.
-                wait_until(lambda: bed.table(new_id, new_group) == expected, 10)
-                self.assertEqual(bed.table(new_id, new_group), expected, version)
-                other = 10 if new_group == 4 else 4
-                self.assertEqual(bed.table(new_id, other), defaults[other], version)
-                self.assertIsNone(bed.log.wait_for(INSTALLED, 0), version)
-                mox.kill()
 
-                # The next start migrates nothing.
-                again = bed.start_mox()
-                self.assertTrue(again.stdout.wait_for(b"Proceeding with loading mox ..\n", 10))
-                self.assertTrue(wait_until(
-                    lambda: "registrations\t1\n" in bed.dmictl("status", check=False)[1], 10), version)
-                time.sleep(1.0)
-                self.assertTrue(again.running(), version)
-                self.assertEqual(self.current_mox(bed), new_id, version)
-                self.assertEqual(bed.table(new_id, new_group), expected, version)
-                again.kill()
+                def carried():
+                    # The new table's values at the old rows' mapped keys (rows
+                    # the new MIF does not have are dropped).
+                    new = {(tuple(row[k] for k in new_key_ids), a): row.get(a)
+                           for row in bed.table(new_id, new_group) for a in SWITCHES}
+                    return {key: new[key] for key in expected if key in new}
+                # The write-back follows the reinstall; let it finish.
+                wait_until(lambda: carried() == {k: expected[k] for k in carried()}, 10)
+                got = carried()
+                self.assertIn(changed, got, version)
+                if old_group == 3:
+                    self.assertEqual(got[(changed[0], 30)], "6", version)
+                self.assertEqual(got, {k: expected[k] for k in got}, version)
+                self.assertIsNone(bed.log.wait_for(INSTALLED, 0), version)
+                table = bed.table(new_id, new_group)
+                mox.kill()
+                self.second_start(bed, new_id)
+                self.assertEqual(bed.table(new_id, new_group), table, version)
             return check
 
         run_in_parallel([case(v, *c) for v, c in cases.items()])
 
     @staticmethod
     def current_mox(bed):
-        """The own component's id once its version reads 2.93, else None."""
+        # The own component's id once its version reads 2.93, else None.
         code, out, _ = bed.dmictl("list", check=False)
         for line in out.splitlines() if code == 0 else []:
             cid, _, name = line.partition("\t")
@@ -177,23 +157,6 @@ class RegistrationTest(BedTestCase):
             if int(fields[0]) == group:
                 return [int(k) for k in fields[3].split()[1:]]
         raise AssertionError("group %d not listed" % group)
-
-    def fresh_tables(self):
-        tool = require("MOX_DMICTL", "the provider's client tool")
-        scratch = tempfile.mkdtemp(prefix="moxe2e-fresh.")
-        self.addCleanup(shutil.rmtree, scratch, True)
-        source = os.path.join(os.environ["MOX_SOURCE_DIR"], "mifs", "mox.mif")
-        env = {k: v for k, v in os.environ.items() if not k.startswith("DMISP_")}
-
-        def dmictl(*args):
-            return subprocess.run([tool, "--db", scratch + "/db"] + [str(a) for a in args], check=True,
-                                  capture_output=True, env=env).stdout.decode()
-        cid = dmictl("install", source).strip()
-        tables = {}
-        for group in (4, 10):
-            ids = [int(line.split("\t")[0]) for line in dmictl("attributes", cid, group).splitlines()]
-            tables[group] = [dict(zip(ids, line.split("\t"))) for line in dmictl("rows", cid, group).splitlines()]
-        return tables
 
 
 if __name__ == "__main__":

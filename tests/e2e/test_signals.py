@@ -1,5 +1,5 @@
-"""Signals sent to the real daemon: which are consumed, which stop it, and when
-it may exit (never before its first 10 seconds are over)."""
+# Signals sent to the real daemon: which are consumed, which stop it, and when
+# it may exit (never before its first 10 seconds are over).
 
 import signal
 import time

@@ -1,4 +1,4 @@
-"""Start-up of the real daemon: the marker files, the floppy probe, its lines."""
+# Start-up of the real daemon: the marker files, the floppy probe, its lines.
 
 import os
 import time
@@ -15,22 +15,14 @@ UMOUNT = "umount /mnt/floppy"
 
 
 def log_sequence(bed):
-    """The daemon's lines and the stub mount/umount calls, in arrival order."""
+    # The daemon's lines and the stub mount/umount calls, in arrival order.
     return [(e.tag, e.message) for e in bed.log.snapshot() if e.tag in ("mox", "stub")]
 
 
 class StartupTest(BedTestCase):
 
-    @classmethod
-    def setUpClass(cls):
-        # Say how the floppy is stood in for: always by the stub mount and
-        # umount commands of the testbed, which make a medium's files appear
-        # in /mnt/floppy. A real FAT image could only be mounted by a kernel
-        # with the msdos filesystem.
-        with open("/proc/filesystems") as f:
-            kernel = f.read().split()
-        print("floppy: stub mount/umount on PATH; this kernel %s the msdos filesystem"
-              % ("has" if "msdos" in kernel else "lacks"))
+    # The floppy is stood in for by the testbed's stub mount and umount
+    # commands, which make a medium's files appear in /mnt/floppy.
 
     def test_start_without_markers_or_floppy(self):
         bed = self.bed("plain")

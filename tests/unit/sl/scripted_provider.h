@@ -1,79 +1,64 @@
-// A scripted DMI provider for the SL tests: it records every command block it
-// receives and answers each one as the script says, completing it from a
-// thread of its own as a real provider does.
+// What the SL tests share: the library's headers, DMI string helpers, and an
+// in-process DMI provider that keeps a copy of every command block it is
+// handed and answers as `responder` says, confirming before DmiInvoke returns.
 #pragma once
 
-#include <cstdint>
 #include <cstring>
 #include <functional>
-#include <mutex>
 #include <string>
-#include <thread>
+#include <tuple>
 #include <vector>
 
-#include "sl/sltypes.h"
+#include "base/sleep.h"
+#include "sl/sl.h"
+#include "sl/slaccess.h"
+#include "sl/slevent.h"
+#include "sl/slhandle.h"
+#include "sl/slkey.h"
+#include "sl/slmap.h"
+#include "sl/slstring.h"
 
-namespace sltest {
-
-// The answer to one command.
 struct Reply {
-    uint32_t invokeResult = 0; // what DmiInvoke returns: 0 accepted, 529 busy, else refused
-    uint32_t status = 0;       // confirm status (word 11)
-    uint32_t count = 1;        // confirm entry count (word 10)
-    bool confirm = true;       // call the confirm callback (commands other than 1024 to 1027)
-    // Writes the confirm buffer; gets its address and size from words 8 and 7.
-    std::function<void(uint8_t* confirm, uint32_t size)> fill;
+    uint32_t invoke = 0;  // DmiInvoke's result: 0 accepted, 529 busy, else refused
+    uint32_t status = 0;  // confirm status (word 11)
+    bool confirm = true;  // false: accepted and never confirmed
+    std::function<void(uint8_t* confirm)> fill = nullptr;
 };
 
-// Writes records into a confirm buffer.
-struct ConfirmWriter {
-    uint8_t* base;
-    uint32_t size;
-    void word(uint32_t offset, uint32_t value) const { storeWord(base + offset, value); }
-    uint32_t string(uint32_t offset, const std::string& text) const
-    {
-        word(offset, static_cast<uint32_t>(text.size()));
-        std::memcpy(base + offset + 4, text.data(), text.size());
-        return offset + 4 + static_cast<uint32_t>(text.size());
-    }
-};
+inline std::string text(const DmiString* s) { return s ? std::string(dmiStringText(s), dmiStringLength(s)) : "null"; }
 
-class ScriptedProvider {
-public:
-    // Initialises the SL library and installs the provider as its entry point.
-    ScriptedProvider();
-    // Waits for outstanding completions and cleans the library up.
-    ~ScriptedProvider();
+// Writes a DMI string at `offset` of `base`.
+inline void putString(uint8_t* base, uint32_t offset, const std::string& text)
+{
+    storeWord(base + offset, static_cast<uint32_t>(text.size()));
+    std::memcpy(base + offset + 4, text.data(), text.size());
+}
 
-    // Replies are used in order; when none is queued, `responder` answers
-    // (default: accept with status 0 and an empty confirm).
-    void push(Reply reply) { queue_.push_back(std::move(reply)); }
-    std::function<Reply(const uint8_t* block)> responder;
-
-    // Copies of the command blocks as they were handed over, in order.
+struct ScriptedProvider {
+    static inline ScriptedProvider* provider = nullptr; // the one in use
+    std::function<Reply(const uint8_t* block)> responder = [](const uint8_t*) { return Reply{}; };
     std::vector<std::vector<uint8_t>> blocks;
-    uint32_t word(size_t command, uint32_t index) const { return loadWordAt(blocks.at(command).data(), index); }
-    uint32_t code(size_t command) const { return word(command, 1); }
+    std::vector<unsigned> sleeps; // requested through the sleep hook
+    bool cleaned = false;
 
-    // Cleans the library up now (the destructor then does not).
-    void cleanupNow();
-    // Joins the thread of the last completion.
-    void joinCompletions();
-
-    static uint32_t invoke(void* block);
-
-private:
-    uint32_t answer(uint8_t* block);
-
-    std::vector<Reply> queue_;
-    size_t next_ = 0;
-    std::vector<std::thread> completions_;
-    void* (*confirmCallback_)(void*) = nullptr;
-    bool cleaned_ = false;
+    ScriptedProvider()
+    {
+        provider = this;
+        moxSetSleepHook([](unsigned ms) { provider->sleeps.push_back(ms); });
+        SLInitialize();
+        SLDmiInvoke = [](void* command) {
+            auto* block = static_cast<uint8_t*>(command);
+            provider->blocks.emplace_back(block, block + SL_COMMAND_SIZE);
+            Reply reply = provider->responder(block);
+            if (reply.invoke == 0 && reply.confirm && reply.fill)
+                reply.fill(static_cast<uint8_t*>(wordPointer(loadWordAt(block, 8))));
+            storeWordAt(block, 11, reply.status);
+            if (reply.invoke == 0 && reply.confirm && loadWordAt(block, 1) < 1024) // 1024-1027 are final at once
+                dmiConfirmFunc(block);
+            return reply.invoke;
+        };
+    }
+    ~ScriptedProvider() { cleanup(), moxSetSleepHook(nullptr); }
+    void cleanup() { cleaned = cleaned || (SLCleanup(), true); }
+    uint32_t word(size_t block, uint32_t index) const { return loadWordAt(blocks.at(block).data(), index); }
 };
-
-// The sleep requests the library made through the sleep hook since the
-// provider was created.
-std::vector<unsigned> sleepRequests();
-
-} // namespace sltest

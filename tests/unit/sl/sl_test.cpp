@@ -1,566 +1,314 @@
+// The SL library against the scripted provider: command blocks byte for byte,
+// the status rules, every confirm and indication layout through the
+// accessors, key lists, name walks, indication delivery and cleanup.
 #include <gtest/gtest.h>
 
 #include <algorithm>
-#include <atomic>
 #include <chrono>
-#include <climits>
-#include <cstring>
-#include <functional>
 #include <map>
-#include <new>
-#include <string>
 #include <thread>
 
-#include "base/sleep.h"
 #include "scripted_provider.h"
-#include "sl/sl.h"
-#include "sl/slaccess.h"
-#include "sl/slevent.h"
-#include "sl/slhandle.h"
-#include "sl/slstring.h"
 
 namespace {
 
-using sltest::Reply;
-using sltest::ScriptedProvider;
+using Words = std::vector<uint32_t>; // word index, value, index, value ...
 
-constexpr uint32_t filler = 0xA5A5A5A5;
+SLKeyList keyList(std::vector<SLKeyEntry> entries)
+{
+    SLKeyList k{0, static_cast<uint32_t>(entries.size()), {}, nullptr};
+    std::copy_n(entries.begin(), std::min<size_t>(entries.size(), SL_MAX_KEYS), k.keys);
+    return k;
+}
 
-// A handle whose command block is filled with a pattern, so that words a
-// command leaves alone can be told from words it writes.
-SLHandle* patternHandle()
+// A row: the call (also its name), the code sent (0: refused, nothing sent),
+// the block's words from 16 on and bytes at an offset.
+#define CMD(call, code, ...) {#call, [&] { return call; }, code, __VA_ARGS__}
+
+TEST(SLCommand, BlocksOfEveryCommand)
+{
+    ScriptedProvider p;
+    SLHandle* h = SLCreateHandle(0);
+    p.responder = [](const uint8_t*) { return Reply{0, 0, true, [](uint8_t* c) { storeWordAt(c, 2, 77); }}; };
+    ASSERT_EQ(SLDmiRegisterMgmt(h, nullptr), 0); // the handle the rest carry
+    uint32_t kv[11] = {4, 9, 12, 13, 14, 15, 16, 17, 18, 19, 20}, v = 0x11223344, pairs[2 * 503] = {5, 6, 7, 8};
+    std::vector<SLKeyEntry> entries;
+    for (uint32_t i = 0; i < 11; ++i)
+        entries.push_back({i + 1, DMI_INTEGER, &kv[i]});
+    uint8_t abc[7] = {3, 0, 0, 0, 'a', 'b', 'c'}; // a string key puts the values behind it off the word grid
+    SLKeyList k = keyList({entries[0], entries[1]}), mixed = keyList({{1, DMI_DISPLAYSTRING, abc}, entries[1]});
+    SLKeyList ten = keyList({entries.begin(), entries.end() - 1}), eleven = keyList(entries);
+    std::string tooLong(SL_COMMAND_SIZE, 'x');
+    std::vector<uint8_t> fits(SL_COMMAND_SIZE - 88 - 24 - 7 - 4); // behind the two keys and their values
+    struct Row {
+        const char* name;
+        std::function<int()> call;
+        uint32_t code;
+        Words words = {};
+        std::pair<uint32_t, std::string> bytes = {};
+    } rows[] = {CMD(SLDmiUnregisterMgmt(h), 257), CMD(SLCancel(h), 258),
+        CMD(SLListComponent(h, nullptr, 7), 512, {16, 7, 17, 0, 18, 0}), CMD(SLListComponent(h, tooLong.data(), 1), 0),
+        CMD(SLListComponent(h, "Zo", 7), 512, {17, 80, 20, 2}, {84, "Zo"}),
+        CMD(SLListFirstComponent(h, nullptr), 513, {16, 0, 17, 0}), CMD(SLListNextComponent(h, 0, 7), 514, {16, 7}),
+        CMD(SLListComponentDesc(h, 7), 515, {16, 7, 19, 0}), CMD(SLListGroup(h, 7, 3), 516, {16, 7, 17, 3}),
+        CMD(SLListFirstGroup(h, 7), 517, {16, 7}), CMD(SLListNextGroup(h, 7, 3), 518, {16, 7, 17, 3}),
+        CMD(SLListGroupDesc(h, 7, 3), 519, {16, 7, 17, 3, 19, 0}),
+        CMD(SLListAttribute(h, 7, 3, 2), 520, {16, 7, 17, 3, 18, 2}),
+        CMD(SLListFirstAttribute(h, 7, 3), 521, {16, 7, 17, 3}),
+        CMD(SLListNextAttribute(h, 7, 3, 2), 522, {16, 7, 17, 3, 18, 2}),
+        CMD(SLListAttributeDesc(h, 7, 3, 2), 523, {16, 7, 17, 3, 18, 2, 19, 0}),
+        CMD(SLGetAttribute(h, 7, 3, 2, nullptr), 768, {16, 7, 17, 3, 18, 0, 19, 0, 20, 2}),
+        CMD(SLGetAttribute(h, 7, 3, 2, &k), 768,
+            {18, 2, 19, 84, 21, 1, 22, 5, 23, 108, 24, 2, 25, 5, 26, 112, 27, 4, 28, 9}),
+        CMD(SLSetAttribute(h, 7, 3, 2, nullptr, 4, &v), 769, {18, 0, 19, 0, 21, 88, 22, v}),
+        CMD(SLSetAttribute(h, 7, 3, 2, &k, 4, &v), 769,
+            {16, 7, 17, 3, 18, 2, 19, 88, 20, 2, 21, 120, 22, 1, 24, 112, 28, 4, 29, 9, 30, v}),
+        CMD(SLSetAttribute(h, 7, 3, 2, &mixed, fits.size(), fits.data()), 769, {21, 123}),
+        CMD(SLSetAttribute(h, 7, 3, 2, &mixed, fits.size() + 1, fits.data()), 0),
+        CMD(SLReserveAttribute(h, 7, 3, 2, &k), 770, {19, 88, 21, 120}),
+        CMD(SLReleaseAttribute(h, 7, 3, 2, nullptr), 771, {19, 0, 21, 88}),
+        CMD(SLGetRow(h, 7, 3, 0, &k), 772, {16, 7, 17, 3, 18, 2, 19, 84, 20, 0}),
+        CMD(SLGetRow(h, 7, 3, 0, &ten), 772, {18, 10, 48, 10, 49, 5, 50, 240, 60, 19}),
+        CMD(SLGetRow(h, 7, 3, 0, &eleven), 0), CMD(SLSetAttribute(h, 7, 3, 2, &eleven, 0, nullptr), 0),
+        CMD(SLGetRow(h, 7, 3, 0, &mixed), 772, {24, 2, 26, 115}, {108, std::string("\3\0\0\0abc\x09\0\0\0", 11)}),
+        CMD(SLGetFirstRow(h, 7, 3, 0, nullptr), 773, {18, 0, 19, 0}), CMD(SLGetNextRow(h, 7, 3, 0, &k), 774, {19, 84}),
+        CMD(SLGetNextRow(h, 7, 3, 0, nullptr), 773, {19, 0}),
+        CMD(SLRegisterCi(h, 1, 2, 3, 2, pairs), 1024, {16, 1, 17, 2, 18, 3, 19, 2, 20, 5, 23, 8}),
+        CMD(SLRegisterCi(h, 1, 2, 3, 502, pairs), 1024, {19, 502}), CMD(SLRegisterCi(h, 1, 2, 3, 503, pairs), 0),
+        CMD(SLUnregisterCi(h, 9), 1025, {16, 9}),
+        CMD(SLCiInstallData(h, 7, "/m"), 1026, {16, 7, 17, 1, 18, 2, 19, 80, 20, 2}, {84, {"/m\0", 3}}),
+        CMD(setenv("UXDMIPATH", "/d", 1) + SLInstallMIF(h, "a.mif"), 1026, {16, 0}, {84, {"/d/a.mif\0", 9}}),
+        CMD(setenv("UXDMIPATH", tooLong.c_str(), 1) + SLInstallMIF(h, "a.mif"), 0),
+        CMD(unsetenv("UXDMIPATH") + SLInstallMIF(h, "a.mif"), 1026, {}, {84, {"/var/dmi/mifs/backup/a.mif\0", 27}}),
+        CMD(SLCiUninstallData(h, 7), 1027, {16, 7})};
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.name);
+        size_t n = p.blocks.size();
+        std::memset(h->command, 0xEE, SL_COMMAND_SIZE); // stale words must be overwritten,
+        storeWordAt(h->command, 4, p.word(n - 1, 4));     // but the handle keeps its command number
+        ASSERT_EQ(row.call(), row.code == 0 ? 1 : 0);
+        ASSERT_EQ(p.blocks.size(), n + (row.code == 0 ? 0 : 1));
+        if (row.code == 0)
+            continue;
+        // Level check, code, block size, management handle (none for installs), command number (a cancel
+        // names the last command), confirm size and address, one confirm.
+        Words words{0, SL_LEVEL_CHECK, 1, row.code, 2, 4096, 3, row.code == 1026 || row.code == 1027 ? 0u : 77u, 4,
+            p.word(n - 1, 4) + (row.code != 258), 7, 8192, 8, pointerWord(h->confirm), 9, 1};
+        words.insert(words.end(), row.words.begin(), row.words.end());
+        for (size_t i = 0; i + 1 < words.size(); i += 2)
+            EXPECT_EQ(p.word(n, words[i]), words[i + 1]) << "word " << words[i];
+        const auto& [offset, bytes] = row.bytes;
+        EXPECT_EQ(std::string(reinterpret_cast<const char*>(p.blocks[n].data()) + offset, bytes.size()), bytes);
+    }
+}
+
+TEST(SLCommand, StatusAndBusyRules)
+{
+    std::tuple<const char*, std::vector<Reply>, int, size_t, std::vector<unsigned>> rows[] = {
+        {"status 1 counts as success", {{0, 1}}, 0, 1, {}}, {"status 2 fails", {{0, 2}}, 1, 1, {}},
+        {"528 is refusal, not busy", {{528, 0}, {0, 0}}, 1, 1, {}}, {"busy once", {{529, 0}, {0, 0}}, 0, 2, {5000}},
+        {"busy twice: no third try", {{529, 0}, {529, 0}, {0, 0}}, 1, 2, {5000, 5000}}};
+    for (const auto& [name, replies, rc, sends, sleeps] : rows) {
+        ScriptedProvider p;
+        p.responder = [&](const uint8_t*) { return replies.at(p.blocks.size() - 1); };
+        EXPECT_EQ(SLListFirstComponent(SLCreateHandle(0), nullptr), rc) << name;
+        EXPECT_EQ(p.blocks.size(), sends) << name;
+        EXPECT_EQ(p.sleeps, sleeps) << name;
+    }
+}
+
+// A handle as command or indication `type` left it: `words` (by index) and
+// strings (by byte offset) over non-zero filler; an indication states
+// `length` bytes and has its data at 64.
+using Strings = std::vector<std::pair<uint32_t, std::string>>;
+SLHandle* confirmOf(uint32_t type, const Words& words, const Strings& strings = {}, uint32_t length = 0,
+    uint32_t level = SL_LEVEL_CHECK)
 {
     SLHandle* h = SLCreateHandle(0);
-    for (uint32_t i = 0; i < SL_COMMAND_SIZE / 4; ++i)
-        storeWordAt(h->command, i, filler);
+    std::memset(h->confirm, 0xAB, h->confirmSize);
+    for (uint32_t i = 0; i < 16; ++i) // the indication header: level, type, length ... data offset
+        storeWordAt(h->command, i, i == 0 ? level : i == 1 ? type : i == 2 ? length : i == 12 ? 64 : 0);
+    for (size_t i = 0; i + 1 < words.size(); i += 2)
+        storeWordAt(h->confirm, words[i], words[i + 1]);
+    for (const auto& [offset, text] : strings)
+        putString(h->confirm, offset, text);
     return h;
 }
 
-// A key list record built by hand, as the catalogue builds them.
-struct Keys {
-    SLKeyList list{};
-    std::vector<std::vector<uint8_t>> values;
-    Keys& add(uint32_t id, uint32_t type, std::vector<uint8_t> value)
-    {
-        values.push_back(std::move(value));
-        list.keys[list.count] = {id, type, values.back().empty() ? nullptr : values.back().data()};
-        ++list.count;
-        return *this;
-    }
-    Keys& integer(uint32_t id, uint32_t value)
-    {
-        std::vector<uint8_t> bytes(4);
-        storeWord(bytes.data(), value);
-        return add(id, DMI_INTEGER, bytes);
-    }
-    Keys& text(uint32_t id, const std::string& s)
-    {
-        std::vector<uint8_t> bytes(4 + s.size());
-        storeWord(bytes.data(), static_cast<uint32_t>(s.size()));
-        std::copy(s.begin(), s.end(), bytes.begin() + 4);
-        return add(id, DMI_DISPLAYSTRING, bytes);
-    }
-    Keys() { values.reserve(SL_MAX_KEYS + 1); }
-};
+template <typename Number> std::string show(SLHandle*, Number n) { return std::to_string(n); }
+std::string show(SLHandle*, DmiString* s) { return text(s); }
+std::string show(SLHandle*, SLKeyList* k) { return k ? std::to_string(loadWord(k->keys[9].value)) : "null"; }
+// A row: the accessor, its handle and arguments, and the value it must read.
+#define A(h, f, w, ...) {#f "(" #h ", " #__VA_ARGS__ ")", [&] { return show(h, f(h __VA_OPT__(, ) __VA_ARGS__)); }, w}
 
-// One command family: the call, its code, and the parameter words it sets
-// (index to value); every other word from 16 to 23 must keep the pattern.
-struct Placement {
-    const char* name;
-    std::function<int(SLHandle*)> call;
-    uint32_t code;
-    std::map<uint32_t, uint32_t> words;
-    std::string text; // expected at offset 84, when not empty
-};
-
-TEST(SLCommand, WordPlacementOfEachCommandFamily)
+TEST(SLAccess, EveryLayout)
 {
-    const uint32_t pairs[] = {11, 12, 13, 14};
-    std::vector<Placement> table = {
-        {"list component with filter", [](SLHandle* h) { return SLListComponent(h, "Base", 7); }, 512,
-         {{16, 7}, {17, 80}, {18, 0}, {20, 4}}, "Base"},
-        {"list component without filter", [](SLHandle* h) { return SLListComponent(h, nullptr, 7); }, 512,
-         {{16, 7}, {17, 0}, {18, 0}}, ""},
-        {"list first component", [](SLHandle* h) { return SLListFirstComponent(h, "X"); }, 513,
-         {{16, 0}, {17, 80}, {18, 0}, {20, 1}}, "X"},
-        {"list next component", [](SLHandle* h) { return SLListNextComponent(h, nullptr, 3); }, 514,
-         {{16, 3}, {17, 0}, {18, 0}}, ""},
-        {"component description", [](SLHandle* h) { return SLListComponentDesc(h, 3); }, 515,
-         {{16, 3}, {19, 0}}, ""},
-        {"list group", [](SLHandle* h) { return SLListGroup(h, 3, 4); }, 516, {{16, 3}, {17, 4}}, ""},
-        {"list first group", [](SLHandle* h) { return SLListFirstGroup(h, 3); }, 517, {{16, 3}}, ""},
-        {"list next group", [](SLHandle* h) { return SLListNextGroup(h, 3, 4); }, 518, {{16, 3}, {17, 4}}, ""},
-        {"group description", [](SLHandle* h) { return SLListGroupDesc(h, 3, 4); }, 519,
-         {{16, 3}, {17, 4}, {19, 0}}, ""},
-        {"list attribute", [](SLHandle* h) { return SLListAttribute(h, 3, 4, 5); }, 520,
-         {{16, 3}, {17, 4}, {18, 5}}, ""},
-        {"list first attribute", [](SLHandle* h) { return SLListFirstAttribute(h, 3, 4); }, 521,
-         {{16, 3}, {17, 4}}, ""},
-        {"list next attribute", [](SLHandle* h) { return SLListNextAttribute(h, 3, 4, 5); }, 522,
-         {{16, 3}, {17, 4}, {18, 5}}, ""},
-        {"attribute description", [](SLHandle* h) { return SLListAttributeDesc(h, 3, 4, 5); }, 523,
-         {{16, 3}, {17, 4}, {18, 5}, {19, 0}}, ""},
-        {"get attribute", [](SLHandle* h) { return SLGetAttribute(h, 3, 4, 5, nullptr); }, 768,
-         {{16, 3}, {17, 4}, {18, 0}, {19, 0}, {20, 5}}, ""},
-        {"reserve attribute", [](SLHandle* h) { return SLReserveAttribute(h, 3, 4, 5, nullptr); }, 770,
-         {{16, 3}, {17, 4}, {18, 0}, {19, 0}, {20, 5}, {21, 88}}, ""},
-        {"release attribute", [](SLHandle* h) { return SLReleaseAttribute(h, 3, 4, 5, nullptr); }, 771,
-         {{16, 3}, {17, 4}, {18, 0}, {19, 0}, {20, 5}, {21, 88}}, ""},
-        {"get row", [](SLHandle* h) { return SLGetRow(h, 3, 4, 5, nullptr); }, 772,
-         {{16, 3}, {17, 4}, {18, 0}, {19, 0}, {20, 5}}, ""},
-        {"get first row", [](SLHandle* h) { return SLGetFirstRow(h, 3, 4, 5, nullptr); }, 773,
-         {{16, 3}, {17, 4}, {18, 0}, {19, 0}, {20, 5}}, ""},
-        {"get next row without keys is get first row",
-         [](SLHandle* h) { return SLGetNextRow(h, 3, 4, 5, nullptr); }, 773,
-         {{16, 3}, {17, 4}, {18, 0}, {19, 0}, {20, 5}}, ""},
-        {"register component interface", [&](SLHandle* h) { return SLRegisterCi(h, 1, 2, 3, 2, pairs); }, 1024,
-         {{16, 1}, {17, 2}, {18, 3}, {19, 2}, {20, 11}, {21, 12}, {22, 13}, {23, 14}}, ""},
-        {"unregister component interface", [](SLHandle* h) { return SLUnregisterCi(h, 9); }, 1025, {{16, 9}}, ""},
-        {"install data", [](SLHandle* h) { return SLCiInstallData(h, 6, "/m/a.mif"); }, 1026,
-         {{16, 6}, {17, 1}, {18, 2}, {19, 80}, {20, 8}}, std::string("/m/a.mif\0", 9)},
-        {"uninstall data", [](SLHandle* h) { return SLCiUninstallData(h, 6); }, 1027, {{16, 6}}, ""},
-        {"unregister", [](SLHandle* h) { return SLDmiUnregisterMgmt(h); }, 257, {}, ""},
-    };
-    for (const Placement& p : table) {
-        SCOPED_TRACE(p.name);
-        ScriptedProvider provider;
-        SLHandle* h = patternHandle();
-        ASSERT_EQ(p.call(h), 0);
-        ASSERT_EQ(provider.blocks.size(), 1u);
-        EXPECT_EQ(provider.code(0), p.code);
-        // The header as handed over.
-        EXPECT_EQ(provider.word(0, 0), SL_LEVEL_CHECK);
-        EXPECT_EQ(provider.word(0, 2), 4096u);
-        EXPECT_EQ(provider.word(0, 3), 0u);
-        EXPECT_EQ(provider.word(0, 4), 0u);
-        EXPECT_EQ(provider.word(0, 5), 0u);
-        EXPECT_EQ(provider.word(0, 6), 0u);
-        EXPECT_EQ(provider.word(0, 7), 8192u);
-        EXPECT_EQ(provider.word(0, 8), pointerWord(h->confirm));
-        EXPECT_EQ(provider.word(0, 9), 1u);
-        EXPECT_EQ(provider.word(0, 10), 0u);
-        EXPECT_EQ(provider.word(0, 11), 0u);
-        for (uint32_t w = 16; w <= 23; ++w) {
-            auto expected = p.words.find(w);
-            if (expected != p.words.end()) {
-                EXPECT_EQ(provider.word(0, w), expected->second) << "word " << w;
-            } else if (p.text.empty() || w < 21) {
-                EXPECT_EQ(provider.word(0, w), filler) << "word " << w << " must be left alone";
-            }
-        }
-        if (!p.text.empty()) {
-            EXPECT_EQ(std::string(reinterpret_cast<const char*>(provider.blocks[0].data()) + 84, p.text.size()),
-                      p.text);
-        }
-    }
+    ScriptedProvider p;
+    SLHandle* comp = confirmOf(512, {0, 7, 2, 100, 3, 2, 4, 120, 30, 1, 31, 160, 32, 2, 33, 170, 2045, 9},
+        {{100, "Board"}, {160, "G1"}, {170, "G2"}});
+    SLHandle* group = confirmOf(516, {0, 30, 1, 200, 2, 240, 3, 1, 4, 300, 5, 31, 6, 220, 7, 260},
+        {{200, "A"}, {220, "B"}, {240, "C1"}, {260, "C2"}});
+    SLHandle* attr = confirmOf(520, {0, 2, 2, 2, 5, 2, 6, 320, 7, 3, 8, 310, 10, 8, 11, 64, 13, 0, 80, 1, 81, 340, 82,
+        0xFFFFFFFE, 83, 360}, {{310, "Label"}, {340, "Warning"}, {360, "Failure"}});
+    // Group entry 0 naming 10 (or 11) integer keys listed at 100, values from 300; or one outside the buffer.
+    Words keys{0, 30, 3, 10, 4, 100};
+    for (uint32_t i = 0; i < 11; ++i)
+        keys.insert(keys.end(), {25 + 3 * i, i + 1, 26 + 3 * i, DMI_INTEGER, 27 + 3 * i, 300 + 4 * i, 75 + i, 40 + i});
+    SLHandle* ten = confirmOf(516, keys);
+    keys[3] = 11;
+    SLHandle* eleven = confirmOf(516, keys);
+    keys[3] = 10, keys[11] = 8190; // the first value
+    SLHandle* outside = confirmOf(516, keys);
+    SLHandle* row = confirmOf(
+        772, {0, 30, 1, 1, 2, 100, 3, 2, 5, 1, 6, 5, 7, 200, 9, 2, 10, 8, 11, 210, 50, 0xFFFFFFFD}, {{210, "CPU"}});
+    // Indications: the stated length bounds every read, whatever lies behind it.
+    SLHandle* removed = confirmOf(3, {16, 9, 18, 140}, {{140, "Out"}}, 120);
+    // An event of one class with two rows of one attribute: rows back to back
+    // from 240, or an array of their offsets at 400.
+    Words event{16, 1, 17, 7, 18, 500, 19, 2, 20, 240, 60, 20, 63, 1, 65, 1, 66, 5, 67, 340, 68, 30, 69, 1, 70, 320,
+        71, 1, 73, 7, 74, 5, 75, 344, 80, 7, 81, 5, 82, 344, 85, 11, 86, 22, 100, 240, 101, 272};
+    SLHandle* rows1 = confirmOf(1, event, {{500, "EventGeneration|x"}}, 510);
+    event[9] = 400;
+    SLHandle* rows2 = confirmOf(1, event, {{500, "EventGeneration|x"}}, 560, 0x444D4932);
+    SLEventSelectRowCnf(rows1, 0, 1);
+    SLEventSelectRowCnf(rows2, 0, 1);
+    std::tuple<const char*, std::function<std::string()>, std::string> rows[] = {A(comp, SLComponentId, "7"),
+        A(comp, SLComponentName, "Board"), A(comp, SLComponentGroupCount, "2"), A(comp, SLComponentGroupId, "2", 1),
+        A(comp, SLComponentGroupName, "G2", 1), A(comp, SLComponentGroupId, "0", 0x7FFFFFFF),
+        A(group, SLGroupId, "31", 1), A(group, SLGroupName, "B", 1), A(group, SLGroupClassName, "C1", 0),
+        A(group, SLGroupClassName, "C2", 1), A(group, SLKeyCount, "1"), A(ten, SLCreateKeyList, "49"),
+        A(eleven, SLCreateKeyList, "null"), A(outside, SLCreateKeyList, "null"), A(attr, SLAttributeId, "3", 1),
+        A(attr, SLAttributeName, "Label", 1), A(attr, SLAttributeType, "8", 1), A(attr, SLEnumerationListCount, "2", 0),
+        A(attr, SLEnumerationValue, "-2", 0, 1), A(attr, SLEnumerationName, "Failure", 0, 1),
+        A(attr, SLEnumerationName, "null", 1, 0), A(row, SLRowGroupId, "30"), A(row, SLRowAttributeCount, "2"),
+        A(row, SLRowAttributeId, "2", 1), A(row, SLRowAttributeType, "8", 1), A(row, SLRowStringPtr, "CPU", 1),
+        A(row, SLRowIntegerValue, "-3", 0), A(row, SLRowAttributeId, "0", 600), A(row, SLKeyCount, "1"),
+        A(removed, SLComponentId, "9"), A(removed, SLComponentName, "null"), A(rows1, SLEventClassCount, "1"),
+        A(rows1, SLEventComponentId, "7", 0), A(rows1, SLEventRowCount, "2", 0),
+        A(rows1, SLEventClassString, "null", 0), A(rows2, SLEventClassString, "EventGeneration|x", 0),
+        A(rows1, SLRowGroupId, "30"), A(rows2, SLRowGroupId, "30"), A(rows1, SLRowAttributeId, "7", 0),
+        A(rows2, SLRowUnsignedValue, "22", 0)};
+    for (const auto& [name, read, want] : rows)
+        EXPECT_EQ(read(), want) << name;
+    storeWordAt(comp->confirm, 2, 8180); // a name whose count runs past the buffer's end
+    EXPECT_EQ(show(comp, SLComponentName(comp)), "null");
+    storeWordAt(row->confirm, 3, 0x7FFFFFFF); // a hostile count: only the entries that fit
+    EXPECT_EQ(slRowAttributesPresent(row), (8192u - 16) / 16);
 }
 
-TEST(SLCommand, RegisterPlacesTheCallbacksAndKeepsTheManagementHandle)
+TEST(SLKey, Compare)
 {
-    ScriptedProvider provider;
-    Reply registered;
-    registered.fill = [](uint8_t* confirm, uint32_t) { storeWordAt(confirm, 2, 0x51); };
-    provider.push(registered);
-    SLHandle* h = patternHandle();
-    ASSERT_EQ(SLDmiRegisterMgmt(h, [](SLHandle*) { return 0; }), 0);
-    EXPECT_EQ(provider.code(0), 256u);
-    EXPECT_EQ(provider.word(0, 16), pointerWord(reinterpret_cast<void*>(&dmiConfirmFunc)));
-    EXPECT_EQ(provider.word(0, 17), pointerWord(reinterpret_cast<void*>(&SLIndicationFunc)));
-    EXPECT_EQ(provider.word(0, 3), 0u) << "before registration";
-
-    // Later commands carry the management handle, except 1026 and 1027, which
-    // complete without a confirm.
-    Reply noConfirm;
-    noConfirm.confirm = false;
-    noConfirm.status = 1;
-    provider.push(Reply{});
-    provider.push(noConfirm);
-    provider.push(noConfirm);
-    EXPECT_EQ(SLListFirstGroup(h, 1), 0);
-    EXPECT_EQ(SLCiInstallData(h, 0, "x"), 0);
-    EXPECT_EQ(SLCiUninstallData(h, 2), 0);
-    EXPECT_EQ(provider.word(1, 3), 0x51u);
-    EXPECT_EQ(provider.word(2, 3), 0u);
-    EXPECT_EQ(provider.word(3, 3), 0u);
-    ASSERT_EQ(SLDmiUnregisterMgmt(h), 0);
-    EXPECT_EQ(provider.word(4, 3), 0x51u);
+    uint32_t one = 1, two = 2, big1[2] = {1, 0}, big2[2] = {2, 0};
+    uint8_t abc[7] = {3, 0, 0, 0, 'a', 'b', 'c'}, abd[7] = {3, 0, 0, 0, 'a', 'b', 'd'};
+    // Types: 1 counter, 5 integer, 6 64-bit integer, 7 octet string, 8 display string.
+    auto key = [](uint32_t type, void* value, uint32_t id = 1) { return keyList({{id, type, value}}); };
+    std::tuple<const char*, SLKeyList, SLKeyList, int> rows[] = {{"same integer", key(5, &one), key(5, &one), 1},
+        {"other integer", key(5, &one), key(5, &two), 0}, {"other counter", key(1, &one), key(1, &two), 0},
+        {"other id", key(5, &one), key(5, &one, 2), 0}, {"one without value", key(5, nullptr), key(5, &one), 0},
+        {"both without value", key(5, nullptr), key(5, nullptr), 1}, {"same string", key(8, abc), key(8, abc), 1},
+        {"other string", key(7, abc), key(7, abd), 0}, {"64-bit not compared", key(6, big1), key(6, big2), 1},
+        {"other count", key(5, &one), keyList({}), 0},
+        {"eleven keys", keyList(std::vector<SLKeyEntry>(11)), keyList(std::vector<SLKeyEntry>(11)), 0}};
+    for (auto& [name, a, b, equal] : rows)
+        EXPECT_EQ(SLCompareKeyLists(&a, &b), equal) << name;
 }
 
-TEST(SLCommand, HandlerIsInPlaceBeforeTheRegisterCommandCompletes)
+TEST(SLMap, NameWalks)
 {
-    ScriptedProvider provider;
-    static std::atomic<int> handled{0};
-    handled = 0;
-    static uint8_t indication[64];
-    storeWordAt(indication, 1, 1);
-    storeWordAt(indication, 2, sizeof indication);
-    // The provider delivers an indication while the register command is
-    // still outstanding.
-    Reply registered;
-    registered.fill = [](uint8_t* confirm, uint32_t) {
-        SLIndicationFunc(indication);
-        storeWordAt(confirm, 2, 1);
+    ScriptedProvider p;
+    std::map<uint32_t, std::pair<uint32_t, std::string>> next = {
+        {0, {5, "Other"}}, {5, {9, std::string("Board\0junk", 10)}}, {9, {12, "Board"}}};
+    bool repeat = false; // a provider answering with the id it was asked after
+    p.responder = [&](const uint8_t* block) {
+        auto it = next.find(repeat ? 0 : loadWordAt(block, 16));
+        if (it == next.end())
+            return Reply{0, 3};
+        return Reply{0, 0, true, [entry = it->second](uint8_t* c) {
+                         storeWordAt(c, 0, entry.first), storeWordAt(c, 2, 100), putString(c, 100, entry.second);
+                     }};
     };
-    provider.push(registered);
-    SLHandle* h = SLCreateHandle(0);
-    ASSERT_EQ(SLDmiRegisterMgmt(h, [](SLHandle*) { return ++handled; }), 0);
-    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
-    while (handled == 0 && std::chrono::steady_clock::now() < deadline)
+    EXPECT_EQ(SLMapComponentNameToId("Board"), 12u) << "the exact name, not one with more bytes";
+    repeat = true;
+    EXPECT_EQ(SLMapComponentNameToId("Absent"), 0u);
+    EXPECT_EQ(p.blocks.size(), 3u + 2) << "the walk ends where the provider repeats itself";
+}
+
+// A command waiting for a confirm that never comes ends when cleanup starts
+// and leaves before cleanup frees its handle; one queued behind it is not sent.
+TEST(SLCleanup, LetsWaitingCommandsLeave)
+{
+    ScriptedProvider p;
+    p.responder = [](const uint8_t*) { return Reply{0, 0, false}; };
+    std::atomic<int> left{0}, failed{0};
+    auto command = [&](SLHandle* h) { failed += SLListFirstComponent(h, nullptr), ++left; };
+    SLHandle* h = SLCreateHandle(0); // made before cleanup begins
+    std::thread first(command, SLCreateHandle(0));
+    std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    std::thread second(command, h);
+    std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    p.cleanup();
+    EXPECT_EQ(left.load(), 2) << "cleanup returned before the commands left";
+    first.join(), second.join();
+    EXPECT_EQ(failed.load(), 2);
+    EXPECT_EQ(p.blocks.size(), 1u);
+}
+
+std::atomic<bool> hold{false};
+std::atomic<int> handled{0}, completions{0};
+
+int handler(SLHandle*)
+{
+    for (++handled; hold;)
         std::this_thread::yield();
-    EXPECT_EQ(handled.load(), 1);
-    SLDmiUnregisterMgmt(h);
+    return 0;
 }
 
-TEST(SLCommand, FailedRegistrationRemovesTheHandler)
+void completion(void*)
 {
-    ScriptedProvider provider;
-    static std::atomic<int> handled{0};
-    handled = 0;
-    Reply failed;
-    failed.status = 2;
-    provider.push(failed);
-    SLHandle* h = SLCreateHandle(0);
-    EXPECT_EQ(SLDmiRegisterMgmt(h, [](SLHandle*) { return ++handled; }), 1);
-    // An indication now reaches no handler: it is completed at once.
-    static std::atomic<int> completed{0};
-    completed = 0;
-    uint8_t indication[64] = {};
-    storeWordAt(indication, 1, 1);
-    storeWordAt(indication, 2, sizeof indication);
-    void (*complete)(void*) = [](void*) { ++completed; };
-    storeWordAt(indication, 11, pointerWord(reinterpret_cast<void*>(complete)));
-    SLIndicationFunc(indication);
-    EXPECT_EQ(completed.load(), 1);
-    EXPECT_EQ(handled.load(), 0);
+    for (++completions; hold;)
+        std::this_thread::yield();
 }
 
-TEST(SLCommand, KeyEncodingOffsets)
+// An event indication stating `length` bytes, with the completion above.
+std::vector<uint32_t> event(uint32_t length)
 {
-    ScriptedProvider provider;
-    SLHandle* h = patternHandle();
-    uint32_t value = 0x01020304;
-
-    // Without keys the value sits at 88.
-    ASSERT_EQ(SLSetAttribute(h, 3, 4, 5, nullptr, 4, &value), 0);
-    EXPECT_EQ(provider.code(0), 769u);
-    EXPECT_EQ(provider.word(0, 18), 0u);
-    EXPECT_EQ(provider.word(0, 19), 0u);
-    EXPECT_EQ(provider.word(0, 21), 88u);
-    EXPECT_EQ(loadWord(provider.blocks[0].data() + 88), value);
-
-    // One type-5 key: its entry at 88, its value at 100, the value at 104.
-    Keys one;
-    one.integer(9, 77);
-    ASSERT_EQ(SLSetAttribute(h, 3, 4, 5, &one.list, 4, &value), 0);
-    const uint8_t* b = provider.blocks[1].data();
-    EXPECT_EQ(provider.word(1, 18), 1u);
-    EXPECT_EQ(provider.word(1, 19), 88u);
-    EXPECT_EQ(loadWord(b + 88), 9u);
-    EXPECT_EQ(loadWord(b + 92), 5u);
-    EXPECT_EQ(loadWord(b + 96), 100u);
-    EXPECT_EQ(loadWord(b + 100), 77u);
-    EXPECT_EQ(provider.word(1, 21), 104u);
-    EXPECT_EQ(loadWord(b + 104), value);
-
-    // A type-8 key of count 5 takes 9 bytes; the type-5 key after it is
-    // unaligned, and so is the attribute value. A key without a value keeps
-    // the running offset and still advances by its type's size.
-    Keys mixed;
-    mixed.text(1, "hello").integer(2, 0xCAFE).add(3, DMI_COUNTER, {});
-    ASSERT_EQ(SLSetAttribute(h, 3, 4, 5, &mixed.list, 4, &value), 0);
-    b = provider.blocks[2].data();
-    const uint32_t values = 88 + 36;
-    EXPECT_EQ(provider.word(2, 18), 3u);
-    EXPECT_EQ(loadWord(b + 88 + 8), values);
-    EXPECT_EQ(loadWord(b + values), 5u);
-    EXPECT_EQ(std::string(reinterpret_cast<const char*>(b) + values + 4, 5), "hello");
-    EXPECT_EQ(loadWord(b + 88 + 20), values + 9);
-    EXPECT_EQ(loadWord(b + values + 9), 0xCAFEu);
-    EXPECT_EQ(loadWord(b + 88 + 32), values + 13) << "a key without value keeps the running offset";
-    EXPECT_EQ(provider.word(2, 21), values + 17);
-    EXPECT_EQ(loadWord(b + values + 17), value);
-
-    // Get-attribute and the row commands put the keys at 84; only the first
-    // list of a chain is encoded.
-    Keys chained;
-    chained.integer(4, 1);
-    mixed.list.next = &chained.list;
-    ASSERT_EQ(SLGetNextRow(h, 3, 4, 5, &mixed.list), 0);
-    EXPECT_EQ(provider.code(3), 774u);
-    EXPECT_EQ(provider.word(3, 18), 3u);
-    EXPECT_EQ(provider.word(3, 19), 84u);
-    b = provider.blocks[3].data();
-    EXPECT_EQ(loadWord(b + 84), 1u);
-    EXPECT_EQ(loadWord(b + 84 + 8), 84u + 36);
-    EXPECT_EQ(loadWord(b + 84 + 24), 3u) << "third key of the first list, not the chained one";
-    ASSERT_EQ(SLGetAttribute(h, 3, 4, 5, &one.list), 0);
-    EXPECT_EQ(provider.word(4, 19), 84u);
-    EXPECT_EQ(loadWord(provider.blocks[4].data() + 84 + 8), 96u);
+    std::vector<uint32_t> w(20, 0xABABABAB);
+    w[1] = 1, w[2] = length, w[11] = pointerWord(reinterpret_cast<void*>(&completion));
+    return w;
 }
 
-TEST(SLCommand, ParametersThatDoNotFitTheCommandBlockAreRefusedUnsent)
+// Indications stating an absurd length are completed at once and dropped. While the handler (or, with
+// no handler, the completion inside the indication callback) is held,
+// removing the handler and cleanup must wait.
+TEST(SLEvent, Delivery)
 {
-    ScriptedProvider provider;
-    SLHandle* h = SLCreateHandle(0);
-    std::string longest(4096 - 84, 'f');
-    std::string path(4096 - 84 - 1, 'p');
-    Keys bigKey;
-    bigKey.text(1, std::string(4096 - 88 - 12 - 4, 'k'));
-    Keys tooBigKey;
-    tooBigKey.text(1, std::string(4096 - 88 - 12 - 4 + 1, 'k'));
-    Keys eleven;
-    for (uint32_t i = 0; i < 10; ++i)
-        eleven.integer(i, i);
-    std::vector<uint8_t> value(4096 - 88);
-    std::vector<uint32_t> pairs(2 * 503);
-
-    struct Case {
-        const char* name;
-        std::function<int()> call;
-        bool fits;
-    };
-    std::vector<Case> cases = {
-        {"filter filling the block", [&] { return SLListComponent(h, longest.c_str(), 0); }, true},
-        {"filter one byte over", [&] { return SLListComponent(h, (longest + "f").c_str(), 0); }, false},
-        {"path with terminator filling the block", [&] { return SLCiInstallData(h, 0, path.c_str()); }, true},
-        {"path one byte over", [&] { return SLCiInstallData(h, 0, (path + "p").c_str()); }, false},
-        {"null path", [&] { return SLCiInstallData(h, 0, nullptr); }, false},
-        {"key filling the block", [&] { return SLSetAttribute(h, 1, 2, 3, &bigKey.list, 0, nullptr); }, true},
-        {"key one byte over", [&] { return SLSetAttribute(h, 1, 2, 3, &tooBigKey.list, 0, nullptr); }, false},
-        {"key over at 84", [&] { return SLGetRow(h, 1, 2, 3, &tooBigKey.list); }, true},
-        {"value filling the block", [&] { return SLSetAttribute(h, 1, 2, 3, nullptr, 4008, value.data()); }, true},
-        {"value one byte over", [&] { return SLSetAttribute(h, 1, 2, 3, nullptr, 4009, value.data()); }, false},
-        {"value after keys over", [&] { return SLSetAttribute(h, 1, 2, 3, &bigKey.list, 1, value.data()); }, false},
-        {"value without data", [&] { return SLSetAttribute(h, 1, 2, 3, nullptr, 4, nullptr); }, false},
-        {"ten keys", [&] { return SLGetRow(h, 1, 2, 3, &eleven.list); }, true},
-        {"eleven keys", [&] { eleven.list.count = 11; return SLGetRow(h, 1, 2, 3, &eleven.list); }, false},
-        {"502 pairs", [&] { return SLRegisterCi(h, 1, 2, 3, 502, pairs.data()); }, true},
-        {"503 pairs", [&] { return SLRegisterCi(h, 1, 2, 3, 503, pairs.data()); }, false},
-    };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.name);
-        size_t before = provider.blocks.size();
-        EXPECT_EQ(c.call(), c.fits ? 0 : 1);
-        EXPECT_EQ(provider.blocks.size(), before + (c.fits ? 1 : 0));
+    ScriptedProvider p;
+    SLEventSetHandler(handler);
+    for (uint32_t length : {51u, (1u << 20) + 1}) { // shorter than the header, above 1 MiB
+        int before = completions;
+        std::vector<uint32_t> indication = event(length);
+        SLIndicationFunc(indication.data()); // a handled one would be completed later, by its event thread
+        EXPECT_EQ(completions.load(), before + 1) << length;
     }
-}
-
-TEST(SLCommand, CommandHandlesCountFromZeroAndCancelNamesTheLastCommand)
-{
-    ScriptedProvider provider;
-    SLHandle* a = SLCreateHandle(0);
-    SLHandle* b = SLCreateHandle(0);
-    ASSERT_EQ(SLListFirstGroup(a, 1), 0);
-    ASSERT_EQ(SLListFirstGroup(b, 1), 0);
-    ASSERT_EQ(SLCancel(a), 0);
-    ASSERT_EQ(SLListFirstGroup(b, 1), 0);
-    ASSERT_EQ(SLCancel(b), 0);
-    ASSERT_EQ(provider.blocks.size(), 5u);
-    EXPECT_EQ(provider.word(0, 4), 0u);
-    EXPECT_EQ(provider.word(1, 4), 1u);
-    EXPECT_EQ(provider.code(2), 258u);
-    EXPECT_EQ(provider.word(2, 4), 0u) << "cancel names a's command";
-    EXPECT_EQ(provider.word(3, 4), 2u) << "a cancel consumes no number";
-    EXPECT_EQ(provider.word(4, 4), 2u);
-}
-
-TEST(SLCommand, ConcurrentCommandsGetDistinctHandles)
-{
-    ScriptedProvider provider;
-    constexpr int perThread = 50;
-    auto issue = [] {
-        SLHandle* h = SLCreateHandle(0);
-        for (int i = 0; i < perThread; ++i)
-            SLListFirstGroup(h, 1);
+    auto expectWaits = [](std::atomic<int>& entered, const std::function<void()>& act) {
+        hold = true;
+        int before = entered;
+        std::vector<uint32_t> indication = event(52); // no more than its header
+        std::thread provider([&] { SLIndicationFunc(indication.data()); });
+        for (int i = 0; i < 5000 && entered.load() == before; ++i)
+            std::this_thread::sleep_for(std::chrono::milliseconds(1));
+        std::atomic<bool> over{false};
+        std::thread([&] { act(), over = true; }).detach();
+        std::this_thread::sleep_for(std::chrono::milliseconds(100));
+        EXPECT_FALSE(over.load());
+        hold = false;
+        provider.join();
+        for (int i = 0; i < 5000 && !over; ++i) // a bounded wait: a broken count would keep it waiting forever
+            std::this_thread::sleep_for(std::chrono::milliseconds(1));
+        ASSERT_TRUE(over.load());
     };
-    std::thread t1(issue), t2(issue);
-    t1.join();
-    t2.join();
-    std::vector<uint32_t> seen;
-    for (size_t i = 0; i < provider.blocks.size(); ++i)
-        seen.push_back(provider.word(i, 4));
-    std::sort(seen.begin(), seen.end());
-    ASSERT_EQ(seen.size(), 2u * perThread);
-    for (uint32_t i = 0; i < seen.size(); ++i)
-        EXPECT_EQ(seen[i], i);
-}
-
-TEST(SLCommand, ProviderAnswersAndResults)
-{
-    struct Case {
-        const char* name;
-        std::vector<Reply> replies;
-        int result;
-        size_t invocations;
-        std::vector<unsigned> sleeps;
-        uint32_t status;
-    };
-    Reply busy;
-    busy.invokeResult = 529;
-    Reply refused;
-    refused.invokeResult = 3;
-    Reply ok;
-    Reply okOne;
-    okOne.status = 1;
-    Reply failed;
-    failed.status = 2;
-    std::vector<Case> cases = {
-        {"accepted, status 0", {ok}, 0, 1, {}, 0},
-        {"status 1 counts as success", {okOne}, 0, 1, {}, 1},
-        {"status 2 fails, readable", {failed}, 1, 1, {}, 2},
-        {"busy once, then accepted", {busy, ok}, 0, 2, {5000}, 0},
-        {"busy twice", {busy, busy}, 1, 2, {5000, 5000}, 0},
-        {"refused at once", {refused}, 1, 1, {}, 0},
-    };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.name);
-        ScriptedProvider provider;
-        for (const Reply& r : c.replies)
-            provider.push(r);
-        SLHandle* h = SLCreateHandle(0);
-        EXPECT_EQ(SLListNextAttribute(h, 1, 2, 3), c.result);
-        EXPECT_EQ(provider.blocks.size(), c.invocations);
-        EXPECT_EQ(sltest::sleepRequests(), c.sleeps);
-        EXPECT_EQ(SLCnfStatus(h), c.status);
-    }
-}
-
-TEST(SLCommand, BusyOnceSleepsFiveSecondsInEarnest)
-{
-    ScriptedProvider provider;
-    moxSetSleepHook(nullptr);
-    Reply busy;
-    busy.invokeResult = 529;
-    provider.push(busy);
-    SLHandle* h = SLCreateHandle(0);
-    auto start = std::chrono::steady_clock::now();
-    EXPECT_EQ(SLListFirstGroup(h, 1), 0);
-    double seconds = std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
-    EXPECT_GE(seconds, 5.0);
-    EXPECT_LT(seconds, 6.5);
-    EXPECT_EQ(provider.blocks.size(), 2u);
-}
-
-TEST(SLCommand, UninitialisedLibrarySendsNothing)
-{
-    ScriptedProvider provider;
-    SLDmiInvoke = nullptr;
-    SLHandle* h = SLCreateHandle(0);
-    EXPECT_EQ(SLListFirstGroup(h, 1), 1);
-    EXPECT_EQ(SLCancel(nullptr), 1);
-    EXPECT_TRUE(provider.blocks.empty());
-}
-
-TEST(SLCommand, InitialiseInstallsTheProviderEntryPoint)
-{
-    ScriptedProvider provider;
-    provider.cleanupNow();
-    SLDmiInvoke = nullptr;
-    SLInitialize();
-    EXPECT_NE(SLDmiInvoke, nullptr);
-    EXPECT_EQ(SLDmiInvoke, &DmiInvoke);
-    SLCleanup();
-}
-
-TEST(SLCommand, CleanupDuringTheWaitEndsItWithStatus522)
-{
-    ScriptedProvider provider;
-    Reply never;
-    never.confirm = false;
-    provider.push(never);
-    // A handle record outside SL memory, so that it outlives the cleanup.
-    alignas(SLHandle) static unsigned char storage[sizeof(SLHandle) + SL_MIN_CONFIRM_SIZE];
-    auto* h = std::launder(new (storage) SLHandle);
-    h->next = h->prev = h;
-    h->confirmSize = SL_MIN_CONFIRM_SIZE;
-
-    std::atomic<int> result{-1};
-    std::thread waiter([&] { result = SLListFirstGroup(h, 1); });
-    while (provider.blocks.empty())
-        std::this_thread::yield();
-    std::this_thread::sleep_for(std::chrono::milliseconds(20));
-    EXPECT_EQ(result.load(), -1) << "still waiting for the confirm";
-    provider.cleanupNow();
-    waiter.join();
-    EXPECT_EQ(result.load(), 1);
-    EXPECT_EQ(SLCnfStatus(h), 522u);
-}
-
-TEST(SLCommand, CleanupLetsTheWaitingCommandLeaveBeforeFreeingItsHandle)
-{
-    // Under AddressSanitizer: the abandoned command must not touch its handle
-    // (an SL handle, freed by the cleanup) after the cleanup has freed it.
-    ScriptedProvider provider;
-    Reply never;
-    never.confirm = false;
-    provider.push(never);
-    SLHandle* h = SLCreateHandle(0);
-    std::atomic<int> result{-1};
-    std::thread waiter([&] { result = SLListFirstGroup(h, 1); });
-    while (provider.blocks.empty())
-        std::this_thread::yield();
-    provider.cleanupNow();
-    waiter.join();
-    EXPECT_EQ(result.load(), 1);
-}
-
-TEST(SLCommand, UnregisterWaitsForRunningHandlersBeforeIssuing257)
-{
-    ScriptedProvider provider;
-    static std::atomic<bool> hold{true};
-    static std::atomic<int> entered{0};
-    hold = true;
-    entered = 0;
-    SLHandle* h = SLCreateHandle(0);
-    ASSERT_EQ(SLDmiRegisterMgmt(h, [](SLHandle*) {
-                  ++entered;
-                  while (hold)
-                      std::this_thread::sleep_for(std::chrono::milliseconds(1));
-                  return 0;
-              }),
-              0);
-    uint8_t indication[64] = {};
-    storeWordAt(indication, 1, 1);
-    storeWordAt(indication, 2, sizeof indication);
-    SLIndicationFunc(indication);
-    while (entered == 0)
-        std::this_thread::yield();
-    std::atomic<int> result{-1};
-    std::thread unregister([&] { result = SLDmiUnregisterMgmt(h); });
-    std::this_thread::sleep_for(std::chrono::milliseconds(30));
-    EXPECT_EQ(provider.blocks.size(), 1u) << "257 waits for the running handler";
-    hold = false;
-    unregister.join();
-    EXPECT_EQ(result.load(), 0);
-    ASSERT_EQ(provider.blocks.size(), 2u);
-    EXPECT_EQ(provider.code(1), 257u);
-}
-
-TEST(SLCommand, ConfirmCallbackClearsPendingAndReturnsItsArgument)
-{
-    ScriptedProvider provider;
-    SLHandle* h = SLCreateHandle(0);
-    h->pending = 1;
-    EXPECT_EQ(dmiConfirmFunc(h->command), h->command);
-    EXPECT_EQ(h->pending, 0u);
-}
-
-TEST(SLCommand, AttributeSizes)
-{
-    uint8_t five[9] = {5, 0, 0, 0, 'a', 'b', 'c', 'd', 'e'};
-    uint8_t huge[4] = {0xFF, 0xFF, 0xFF, 0xFF};
-    struct Case {
-        int type;
-        const void* value;
-        unsigned size;
-    } cases[] = {
-        {1, nullptr, 4}, {3, nullptr, 4}, {5, nullptr, 4}, {2, nullptr, 8}, {6, nullptr, 8},
-        {7, five, 9}, {8, five, 9}, {7, nullptr, 0}, {8, nullptr, 0}, {11, nullptr, 28},
-        {4, five, 0}, {0, nullptr, 0}, {-1, nullptr, 0},
-        {8, huge, UINT_MAX}, // a count that would wrap saturates
-    };
-    for (const Case& c : cases)
-        EXPECT_EQ(SLAttributeSize(c.type, c.value), c.size) << "type " << c.type;
+    expectWaits(handled, [] { SLEventSetHandler(nullptr); });
+    expectWaits(completions, [&] { p.cleanup(); });
 }
 
 } // namespace
