@@ -95,12 +95,15 @@ void waitForWork()
 
 // The class string's first 16 characters, read whatever the string's length
 // word says (the class test is a prefix test), but never past the end of the
-// indication's buffer.
+// indication: its stated length, within the handle's buffer.
 void classPrefix(SLHandle* handle, const DmiString* classString, char (&prefix)[17])
 {
     std::memset(prefix, 0, sizeof prefix);
     const char* text = dmiStringText(classString);
     uint32_t limit = handle->confirmSize;
+    uint32_t stated = loadWordAt(handle->command, 2);
+    if (SLIndicationType(handle) < 256 && stated < limit)
+        limit = stated;
     const char* end = reinterpret_cast<const char*>(handle->confirm) + limit;
     size_t available = text < end ? static_cast<size_t>(end - text) : 0;
     std::memcpy(prefix, text, available < 16 ? available : 16);
