@@ -2,7 +2,7 @@
 
 #include <cstring>
 
-#include "daemon/testmail.h"
+#include "daemon/emailcheck.h"
 
 #ifndef MOX_VERSION
 #define MOX_VERSION "unknown"

@@ -1,4 +1,4 @@
-#include "daemon/testmail.h"
+#include "daemon/emailcheck.h"
 
 #include <cstring>
 
