@@ -82,13 +82,25 @@ def interleave(mutants):
     return ordered
 
 
+def resolve(tree, path):
+    """The mutant's file in `tree`; a file moved to another folder of src/
+    since the sample was written is found by its name."""
+    if os.path.exists(os.path.join(tree, path)):
+        return os.path.join(tree, path)
+    name = os.path.basename(path)
+    for folder, _, files in os.walk(os.path.join(tree, "src")):
+        if name in files:
+            return os.path.join(folder, name)
+    return os.path.join(tree, path)
+
+
 def check_sample(tree, mutants):
     ids = set()
     for m in mutants:
         if m.id in ids:
             sys.exit("duplicate mutant id %s" % m.id)
         ids.add(m.id)
-        with open(os.path.join(tree, m.path)) as f:
+        with open(resolve(tree, m.path)) as f:
             count = f.read().count(m.original)
         if count != 1:
             sys.exit("%s: %r occurs %d times in %s (want exactly once)" % (m.id, m.original, count, m.path))
@@ -198,7 +210,7 @@ def main():
         sys.exit("the unmutated tree fails its tests; see %s/baseline.log" % args.scratch)
 
     for m in mutants:
-        path = os.path.join(tree, m.path)
+        path = resolve(tree, m.path)
         with open(path) as f:
             original = f.read()
         log = os.path.join(args.scratch, "%s.log" % m.id)
