@@ -172,16 +172,19 @@ void moxMain()
     openStandardDescriptors();
     // Lines reach a supervisor that captures standard output as they are written.
     setvbuf(stdout, nullptr, _IOLBF, 0);
+    // Signals sent to the process must reach only the signal thread's sigwait:
+    // block them here too, or the kernel delivers them to this thread. Blocked
+    // before the marker check, so that a stop requested while the floppy is
+    // probed waits for the signal thread instead of killing the process (the
+    // floppy commands inherit the blocked set, as system() passes it on).
+    sigset_t wait;
+    if (daemon_defaultWaitSet(&wait) == 0)
+        pthread_sigmask(SIG_SETMASK, &wait, nullptr);
     if (check_for_moxnot() == 4) {
         printf("Mox has been disabled.\n");
         moxLog(LOG_ERR, "%s", "Mox has been disabled.\n");
         exit(0);
     }
-    // Signals sent to the process must reach only the signal thread's sigwait:
-    // block them here too, or the kernel delivers them to this thread.
-    sigset_t wait;
-    if (daemon_defaultWaitSet(&wait) == 0)
-        pthread_sigmask(SIG_SETMASK, &wait, nullptr);
 
     pthread_t thread;
     int error = pthread_create(&thread, nullptr, mainThread, nullptr);
