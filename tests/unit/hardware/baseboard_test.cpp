@@ -15,14 +15,10 @@ std::string displayGroup(unsigned id, const std::string& cls)
 class Baseboard : public Provider {
 protected:
     uint32_t board = 0;
-    void SetUp() override
-    {
-        Provider::SetUp();
-        manage();
-    }
     // A fresh database whose baseboard holds `groups` (none: the shipped baseboard).
     void withBaseboard(std::initializer_list<std::string> groups)
     {
+        managing = true; // freshDatabase registers as the management application
         freshDatabase();
         board = groups.size() == 0 ? install("baseboard.mif", true) : install(mifComponent("Board", groups));
         catalogue(board, 1);
@@ -63,7 +59,7 @@ TEST_F(Baseboard, DisplayLineOfThirtyTwoCharactersInTheFirstListedForm)
     }
 }
 
-TEST_F(Baseboard, EachRequestSetsItsOwnAttributeAndTheClassTakesAnyVersion)
+TEST_F(Baseboard, EachRequestSetsItsOwnAttributeTheClassTakesAnyVersionAndStatus512)
 {
     withBaseboard({});
     ASSERT_EQ(SysCtrlInitialize(), 0);
@@ -95,12 +91,8 @@ TEST_F(Baseboard, EachRequestSetsItsOwnAttributeAndTheClassTakesAnyVersion)
         EXPECT_EQ(value(board, 6, 25), found ? "2" : "0");
         EXPECT_EQ(value(board, 3, 6), "1") << "the page goes to the baseboard";
     }
-}
-
-// A listing with status 512 counts only when it holds a component record:
-// the confirm still holds the previous listing otherwise.
-TEST_F(Baseboard, Status512CountsOnlyWithAComponentRecord)
-{
+    // A listing with status 512 counts only when it holds a component record:
+    // the confirm still holds the previous listing otherwise.
     withBaseboard({});
     dmisp::injectListingStatus512(1);
     EXPECT_EQ(SysCtrlFindGroupId(h, 0), 31u);

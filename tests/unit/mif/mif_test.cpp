@@ -17,11 +17,7 @@ namespace {
 
 using Texts = std::vector<std::string>;
 
-std::string attr(int id, const char* name, const char* type, const char* value)
-{
-    return std::string("start attribute\n name = \"") + name + "\"\n id = " + std::to_string(id) + "\n type = " +
-           type + "\n access = read-write\n value = " + value + "\nend attribute\n";
-}
+std::string attr(int id, const char* name, const char* type, const char* value) { return attribute(id, type, value, name); }
 
 // Scalars of every converted type (group 1), a table named by its description (2).
 const std::string scalarsMif = mifComponent(
@@ -35,22 +31,19 @@ const std::string scalarsMif = mifComponent(
          "end group\nstart table\n name = \"Described\"\n class = \"T|D|1\"\n id = 2\n { 1, \"Fan in front\" }\n"
          " { 2, \"Fan at the back\" }\nend table\n"});
 
-class Catalogue : public Provider {
-protected:
-    uint32_t component = 0, board = 0;
-    void SetUp() override
-    {
-        Provider::SetUp();
-        component = install(scalarsMif);
-        board = install(boardMif("Test Board"));
-        manage();
-        catalogue(component, 0);
-        catalogue(board, 1);
-    }
-};
-
-TEST_F(Catalogue, ValuesAndRowNamesAsTextCutToTheBuffer)
+std::atomic<bool> deliveryRelease{false}, deliveryInside{false};
+void slowCompletion(void*)
 {
+    for (deliveryInside = true; !deliveryRelease;)
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+}
+
+TEST_F(Provider, CatalogueValuesRowNamesActionRowsAndCleanup)
+{
+    uint32_t component = install(scalarsMif), board = install(boardMif("Test Board"));
+    manage();
+    catalogue(component, 0);
+    catalogue(board, 1);
     struct Row { uint32_t attribute; const char* set; int len; const char* text; int result; } rows[] = {
         {1, nullptr, 64, "42", 2}, {1, "-12345", 5, "-123", 4}, {1, nullptr, 1, "", 0},
         {1, "-2147483648", 64, "Unsupported", 0}, {1, nullptr, 5, "Unsu", 0}, {1, "-2147483647", 64, "-2147483647", 11},
@@ -75,32 +68,18 @@ TEST_F(Catalogue, ValuesAndRowNamesAsTextCutToTheBuffer)
         EXPECT_EQ(BaseboardRowName(h, c, group, k->next != nullptr ? k->next : k, buffer), text[0] == ' ' ? 0 : int(strlen(text)));
         EXPECT_STREQ(buffer, text);
     }
-}
-
-// A row claiming more attributes than its confirm can hold.
-TEST_F(Catalogue, ActionRowCopyClampsAHostileCount)
-{
+    // A row claiming more attributes than its confirm can hold.
     ASSERT_EQ(SLGetNextRow(h, board, 3, 0, nullptr), 0);
     storeWordAt(const_cast<uint8_t*>(pGetRow(h)), 3, 0xFFFFFFFFu);
     ActionRow* row = GetNewActionRow();
     EXPECT_EQ(FillActionTable(h, row), 0);
     EXPECT_EQ(row->count, 2) << "the two integers of the row";
     DeleteActionTable(row);
-}
 
-std::atomic<bool> deliveryRelease{false}, deliveryInside{false};
-void slowCompletion(void*)
-{
-    for (deliveryInside = true; !deliveryRelease;)
-        std::this_thread::sleep_for(std::chrono::milliseconds(1));
-}
-
-// Cleanup while one command waits for a confirm that never comes, a second
-// waits for the command lock, and the provider is inside the indication
-// callback: cleanup returns only after all have left, the waiting command is
-// not sent, and the callback, finding no handler, makes no handle.
-TEST_F(Catalogue, CleanupWaitsForCommandsAndIndicationsUnderWay)
-{
+    // Cleanup while one command waits for a confirm that never comes, a second
+    // waits for the command lock, and the provider is inside the indication
+    // callback: cleanup returns only after all have left, the waiting command is
+    // not sent, and the callback, finding no handler, makes no handle.
     ASSERT_TRUE(dmisp::waitIndicationsCompleted(10000)); // the installs' own indications
     SLHandle* second = SLCreateHandle(0);
     const uint64_t calls = dmisp::commandsReceived();
@@ -133,10 +112,7 @@ TEST_F(Catalogue, CleanupWaitsForCommandsAndIndicationsUnderWay)
     h = SLCreateHandle(0);
 }
 
-uint32_t own()
-{
-    return dmisp::componentId("Zorek Tessarin Server Manager - Mox");
-}
+uint32_t own() { return dmisp::componentId("Zorek Tessarin Server Manager - Mox"); }
 
 // The first listing after the own entry (stale: after `staleAfter`) answers
 // with status 512; a stale answer leaves the previous component in the confirm.
@@ -198,16 +174,7 @@ std::string oldOwnMif(const std::string& version)
     return ownMifWith(version, "old", {8}, {7, 8}, {actionRow(vendorKeys + ", 0", {7}, ""), actionRow("2, 2, 2, 2, 2, 1", {7}, "")});
 }
 
-// Attributes 7, 8, 30 and 17 of a row.
-Texts actions(uint32_t group, const Texts& keys)
-{
-    Texts got;
-    for (uint32_t a : {7, 8, 30, 17})
-        got.push_back(Provider::value(own(), group, a, keys));
-    return got;
-}
-
-TEST_F(Provider, CarryOverReadsTheGroupOfItsBand)
+TEST_F(Provider, CarryOverBandsFailuresAndKeylessRows)
 {
     ownMifFile(ownMifWith("2.93", "new", {}, {}));
     const Texts fresh{"0", "0", "1", "new"};
@@ -219,9 +186,24 @@ TEST_F(Provider, CarryOverReadsTheGroupOfItsBand)
         install(oldOwnMif(r.version));
         ASSERT_EQ(RegisterWithSL(), 0);
         EXPECT_EQ(value(own(), 1, 3), "2.93");
-        EXPECT_EQ(actions(4, {"1", "33", "3", "0", "-2147483648", "0"}), r.vendor);
-        EXPECT_EQ(actions(10, {"1", "50", "1", "0", "0", "4", "7", "8"}), r.standard);
+        // Attributes 7, 8, 30 and 17 of each row.
+        for (uint32_t i = 0; i < 4; ++i) {
+            uint32_t a = std::vector<uint32_t>{7, 8, 30, 17}[i];
+            EXPECT_EQ(value(own(), 4, a, {"1", "33", "3", "0", "-2147483648", "0"}), r.vendor[i]) << a;
+            EXPECT_EQ(value(own(), 10, a, {"1", "50", "1", "0", "0", "4", "7", "8"}), r.standard[i]) << a;
+        }
     }
+    // A refused reinstall leaves no component.
+    freshDatabase();
+    install(oldOwnMif("2.40"));
+    SLDmiInvoke = [](void* block) { // refuses the install that follows an uninstall
+        if (loadWordAt(block, 1) == 1026 && dmisp::commandsReceived(1027) != 0)
+            dmisp::injectRefuse(1);
+        return DmiInvoke(block);
+    };
+    EXPECT_EQ(RegisterWithSL(), 3);
+    EXPECT_TRUE(dmisp::components().empty());
+    SLDmiInvoke = DmiInvoke;
     // The current version, or no new file to read: nothing is uninstalled.
     for (const char* v : {"2.93", "2.60"}) {
         freshDatabase();
@@ -233,27 +215,6 @@ TEST_F(Provider, CarryOverReadsTheGroupOfItsBand)
         EXPECT_EQ(dmisp::commandsReceived(1027), removals) << v;
         EXPECT_EQ(own(), before) << v;
     }
-}
-
-// Refuses the install that follows an uninstall.
-uint32_t refuseReinstall(void* block)
-{
-    if (loadWordAt(block, 1) == 1026 && dmisp::commandsReceived(1027) != 0)
-        dmisp::injectRefuse(1);
-    return DmiInvoke(block);
-}
-
-TEST_F(Provider, CarryOverFailuresAndKeylessRows)
-{
-    ownMifFile(ownMifWith("2.93", "new", {}, {}));
-    install(oldOwnMif("2.40"));
-    SLDmiInvoke = refuseReinstall;
-    EXPECT_EQ(RegisterWithSL(), 3);
-    EXPECT_TRUE(dmisp::components().empty());
-    SLDmiInvoke = DmiInvoke;
-    freshDatabase();
-    install(oldOwnMif("2.93"));
-    ASSERT_EQ(RegisterWithSL(), 0);
     // The ComponentID group has no keys: the row after "no keys" would be the first again.
     moxActionTableGroup = 1;
     ActionRow* first = GetNewActionRow();

@@ -8,9 +8,6 @@
 #include <fstream>
 #include <filesystem>
 #include <mutex>
-#include <string>
-#include <utility>
-#include <vector>
 
 #include "base/log.h"
 #include "daemon/events.h"

@@ -1,12 +1,12 @@
 #include "testmifs.h"
 
-namespace {
-
-std::string attribute(int id, const std::string& type, const std::string& value = "0")
+std::string attribute(int id, const std::string& type, const std::string& value, const std::string& name)
 {
-    return "start attribute\n name = \"A" + std::to_string(id) + "\"\n id = " + std::to_string(id) + "\n type = " +
-           type + "\n access = read-write\n value = " + value + "\nend attribute\n";
+    return "start attribute\n name = \"" + (name.empty() ? "A" + std::to_string(id) : name) + "\"\n id = " +
+           std::to_string(id) + "\n type = " + type + "\n access = read-write\n value = " + value + "\nend attribute\n";
 }
+
+namespace {
 
 std::string integers(int from, int to)
 {

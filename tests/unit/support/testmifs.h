@@ -28,6 +28,8 @@ std::string actionRow(const std::string& keys, std::initializer_list<int> on, co
 // table (3), a fan table without names (5), a vendor error group (30).
 std::string boardMif(const std::string& name);
 
+// An attribute named `name` (empty: "A<id>").
+std::string attribute(int id, const std::string& type, const std::string& value = "0", const std::string& name = "");
 std::string mifComponent(const std::string& name, std::initializer_list<std::string> groups);
 // A scalar group holding string attributes `strings` (displaystring(32)) and
 // an enumeration `enumId` (0 "No Action", then `texts` as 1, 2, ...).
