@@ -1,27 +1,27 @@
-"""What an administrator checks before trusting the daemon: the version flag,
-readiness on a service manager's notify socket, the test alert while the
-daemon runs, and the action log."""
+"""What an administrator checks before trusting the daemon, in one bed: the
+version flag, readiness on a service manager's notify socket, the action log
+and the test alert while the daemon runs."""
 
 import os
 import re
 import socket
-import sys
 import time
 
-from test_events import EMAIL, RESET, EventBedCase
-from testbed import HERE, LOG_NOTICE, require
+from test_events import EMAIL, INSTALLED, MOX_COMPONENT, RESET, EventBedCase
+from testbed import LOG_INFO, LOG_NOTICE, require
 
 PROBE = "event Temperature Probe of Zorek Tessarin Baseboard"
 
 
 class AdminTest(EventBedCase):
 
-    def test_version_then_readiness(self):
-        bed = self.bed("version")
-        mox = require("MOX_BIN", "the mox daemon")
+    def test_version_readiness_action_log_and_test_alert(self):
+        require("MOX_OBX_PRELOAD", "the simulated OBX driver")
+        bed = self.bed("admin")
+        mox_bin = require("MOX_BIN", "the mox daemon")
         for flag, expected in (("--version", b"mox 2.93\n"), ("--help", b"Usage: mox [--version")):
             started = time.monotonic()
-            done = bed.run([mox, flag], timeout=10)
+            done = bed.run([mox_bin, flag], timeout=10)
             self.assertEqual((done.returncode, done.stderr), (0, b""), flag)
             self.assertTrue(done.stdout.startswith(expected), done.stdout)
             self.assertLess(time.monotonic() - started, 3, flag)
@@ -30,12 +30,15 @@ class AdminTest(EventBedCase):
         self.assertEqual(bed.log.snapshot(tag=None), [])
         self.assertEqual(os.listdir(bed.paths["db"]), [])
 
+        # No SMTP server set while the default actions rows ask for e-mail.
+        ids = {"baseboard": int(bed.dmictl("install", os.path.join(bed.paths["mifs"], "baseboard.mif")))}
+        bed.dmictl("set", ids["baseboard"], 1012, 3, "ops@example.org")
+        bed.write("cfg", "mox.cfg", "# log what I do\nActionLog = TRUE\n")
         notify = socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM)
         self.addCleanup(notify.close)
-        path = os.path.join(bed.root, "notify.sock")
-        notify.bind(path)
+        notify.bind(os.path.join(bed.root, "notify.sock"))
         notify.settimeout(60)
-        bed.start_mox({"NOTIFY_SOCKET": path})
+        mox = bed.start_mox({"NOTIFY_SOCKET": os.path.join(bed.root, "notify.sock")})
         messages = []
         while "READY=1" not in messages:
             messages.append(notify.recv(4096).decode())
@@ -43,30 +46,25 @@ class AdminTest(EventBedCase):
         self.assertEqual(messages, ["STATUS=Checking marker files", "STATUS=Registering with the DMI service provider",
                                     "STATUS=Handling events", "READY=1"])
         # Registration (the daemon's MIF installed) came before readiness.
-        installed = bed.log.wait_for("MOX - installed mox.mif\n", 0)
-        self.assertLess(installed.arrival, ready_at)
+        self.assertLess(self.assertLogged(bed, INSTALLED, LOG_INFO, timeout=0).arrival, ready_at)
         self.assertTrue(bed.wait_registered(timeout=5))
-
-    def test_action_log_and_test_alert(self):
-        require("MOX_OBX_PRELOAD", "the simulated OBX driver")
-        # No SMTP server set while the default actions rows ask for e-mail.
-        bed, mox, ids, _ = self.event_bed("admin", config="# log what I do\nActionLog = TRUE\n",
-                                          email={3: "ops@example.org"})
+        ids["mox"] = bed.component_id(MOX_COMPONENT)
         self.assertLogged(bed, lambda m: re.fullmatch(
             r"mox action: warning: [1-9]\d* actions-table rows ask for e-mail but no SMTP server is set "
             r"\(baseboard group 1012, attribute 1\)\n", m) is not None, LOG_NOTICE, timeout=0)
+
         bed.dmictl("set", ids["baseboard"], 1012, 1, "127.0.0.1")
-        bed.start_smtp()
+        server = bed.start_smtp()
         self.critical_temperature(bed, ids, [EMAIL, RESET])
         start = bed.log.mark()
         self.raise_temperature(bed, ids)
         mailed = self.assertLogged(bed, "mox action: e-mail alert for %s delivered to server[127.0.0.1]\n" % PROBE,
                                    LOG_NOTICE, timeout=30, start=start)
         reset = self.assertLogged(bed, "mox action: reset ordered for %s\n" % PROBE, LOG_NOTICE, start=start)
-        self.assertLess(mailed.sequence, reset.sequence)
+        entries = bed.log.snapshot()
+        self.assertLess(entries.index(mailed), entries.index(reset))
 
         # The test alert, while the daemon holds the provider's database.
-        mox_bin = require("MOX_BIN", "the mox daemon")
         done = bed.run([mox_bin, "--test-email"], timeout=60)
         out = done.stdout.decode()
         self.assertEqual(done.returncode, 0, out + done.stderr.decode())
@@ -82,20 +80,15 @@ class AdminTest(EventBedCase):
         self.assertTrue(mox.running())
 
         # A server that refuses the recipient: the step and its reason, status 1.
-        refusing = os.path.join(bed.root, "refusing")
-        os.mkdir(refusing)
-        with open(os.path.join(refusing, "replies.json"), "w") as f:
-            f.write('{"rcpt": "550 no such user"}')
-        bed.spawn([sys.executable, os.path.join(HERE, "smtpserver.py"), refusing, "127.0.0.2", "25"])
-        self.assertTrue(any(os.path.exists(os.path.join(refusing, "ready")) or time.sleep(0.05) for _ in range(200)))
-        bed.dmictl("set", ids["baseboard"], 1012, 1, "127.0.0.2")
+        server.kill()
+        os.remove(os.path.join(bed.paths["smtp"], "ready"))
+        bed.start_smtp({"rcpt": "550 no such user"})
         done = bed.run([mox_bin, "--test-email"], timeout=60)
-        out = done.stdout.decode()
-        self.assertEqual(done.returncode, 1, out)
-        self.assertIn("RCPT TO: failed in step 14: The server[127.0.0.2] returned the following value:[550]"
-                      " - reply: 550 no such user\n", out)
+        self.assertEqual(done.returncode, 1, done.stdout)
+        self.assertIn("RCPT TO: failed in step 14: The server[127.0.0.1] returned the following value:[550]"
+                      " - reply: 550 no such user\n", done.stdout.decode())
         # The daemon's next alert fails the same way, and the action log says where.
         start = bed.log.mark()
         self.raise_temperature(bed, ids)
-        self.assertLogged(bed, "mox action: e-mail alert for %s failed in step 14 (RCPT TO): The server[127.0.0.2] "
+        self.assertLogged(bed, "mox action: e-mail alert for %s failed in step 14 (RCPT TO): The server[127.0.0.1] "
                           "returned the following value:[550]\n" % PROBE, LOG_NOTICE, timeout=30, start=start)

@@ -2,15 +2,9 @@
 # Sourced with the build directory in $build and the source tree in $source.
 
 failures=0
-fail() {
-    echo "FAIL: $*" >&2
-    failures=$((failures + 1))
-}
+fail() { echo "FAIL: $*" >&2; failures=$((failures + 1)); }
 finish() {
-    if [ "$failures" -ne 0 ]; then
-        echo "$failures check(s) failed" >&2
-        exit 1
-    fi
+    [ "$failures" -eq 0 ] || { echo "$failures check(s) failed" >&2; exit 1; }
     echo "all checks passed"
     exit 0
 }
@@ -36,41 +30,27 @@ check_tree() {
     found=$(cd "$root" && find . -type f -o -type l | sed 's/^\.//' | sort)
     [ "$found" = "$expected_files" ] || fail "files below $root:"$'\n'"$found"$'\n'"expected:"$'\n'"$expected_files"
 
-    local mox=$root/usr/local/ubo/bin/mox lib=$root/usr/local/ubo/lib/libdmisp.so
-    [ -x "$mox" ] || fail "mox is not executable"
-    [ -x "$root/usr/local/ubo/bin/dmictl" ] || fail "dmictl is not executable"
-    local what
-    what=$(file -b "$mox")
-    case $what in
-        "ELF 32-bit LSB "*"executable, Intel 80386"*) ;;
-        *) fail "mox is not an i386 executable: $what" ;;
-    esac
-    what=$(file -b "$lib")
-    case $what in
-        "ELF 32-bit LSB shared object, Intel 80386"*) ;;
-        *) fail "libdmisp.so is not an i386 shared library: $what" ;;
-    esac
-
+    local mox=$root/usr/local/ubo/bin/mox prog runpath pair
+    case $(file -b "$mox") in "ELF 32-bit LSB "*"executable, Intel 80386"*) ;; *) fail "mox is not i386" ;; esac
+    case $(file -b "$root/usr/local/ubo/lib/libdmisp.so") in
+        "ELF 32-bit LSB shared object, Intel 80386"*) ;; *) fail "libdmisp.so is not an i386 library" ;; esac
     # The daemon and the tool find the provider library at its installed
     # place, and nowhere in the build tree.
-    local prog runpath
     for prog in "$mox" "$root/usr/local/ubo/bin/dmictl"; do
+        [ -x "$prog" ] || fail "$prog is not executable"
         runpath=$(readelf -d "$prog" | sed -n 's/.*(RUNPATH).*\[\(.*\)\]/\1/p')
         [ "$runpath" = /usr/local/ubo/lib ] || fail "RUNPATH of $prog is '$runpath'"
         readelf -d "$prog" | grep 'NEEDED.*\[libdmisp\.so\]' >/dev/null || fail "$prog does not need libdmisp.so"
     done
-
     # The destinations are the paths compiled into the daemon.
-    local path
-    for path in /usr/local/ubo/bin/mox.cfg /var/dmi/mifs/backup; do
-        strings -n 8 "$mox" | grep -xF "$path" >/dev/null || fail "the daemon does not use $path"
+    for pair in /usr/local/ubo/bin/mox.cfg /var/dmi/mifs/backup; do
+        strings -n 8 "$mox" | grep -xF "$pair" >/dev/null || fail "the daemon does not use $pair"
     done
-
-    cmp -s "$root/var/dmi/mifs/backup/mox.mif" "$source/mifs/mox.mif" || fail "mox.mif differs from the source"
-    cmp -s "$root/lib/systemd/system/mox.service" "$source/packaging/mox.service" || fail "unit differs"
-    cmp -s "$root/usr/local/ubo/bin/mox.cfg.example" "$source/packaging/mox.cfg.example" || fail "sample differs"
-    local page
-    for page in mox dmictl; do
-        gzip -dc "$root/usr/share/man/man8/$page.8.gz" | cmp -s - "$source/packaging/$page.8" || fail "$page.8 differs"
+    for pair in var/dmi/mifs/backup/mox.mif:mifs/mox.mif lib/systemd/system/mox.service:packaging/mox.service \
+        usr/local/ubo/bin/mox.cfg.example:packaging/mox.cfg.example; do
+        cmp -s "$root/${pair%%:*}" "$source/${pair#*:}" || fail "${pair%%:*} differs from ${pair#*:}"
+    done
+    for pair in mox dmictl; do
+        gzip -dc "$root/usr/share/man/man8/$pair.8.gz" | cmp -s - "$source/packaging/$pair.8" || fail "$pair.8 differs"
     done
 }

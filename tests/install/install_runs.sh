@@ -41,21 +41,16 @@ systemd-analyze security --offline=true --threshold=50 "$unit" >/dev/null 2>&1 |
 
 value() { sed -n "s/^$1=//p" "$unit"; }
 exec_start=$(value ExecStart) workdir=$(value WorkingDirectory)
-[ "$(value Type)" = notify ] || fail "Type=$(value Type)"
-[ "$(value KillSignal)" = SIGTERM ] || fail "KillSignal=$(value KillSignal)"
-[ "$exec_start" = /usr/local/ubo/bin/mox ] || fail "ExecStart=$exec_start"
-[ "$workdir" = /usr/local/ubo/bin ] || fail "WorkingDirectory=$workdir"
-environment=()
-while read -r assignment; do environment+=("$assignment"); done < <(value Environment)
+settings="$(value Type) $(value KillSignal) $exec_start $workdir"
+[ "$settings" = "notify SIGTERM /usr/local/ubo/bin/mox /usr/local/ubo/bin" ] || fail "unit settings: $settings"
+mapfile -t environment < <(value Environment)
 [ "${#environment[@]}" -gt 0 ] || fail "no Environment"
 # StateDirectory= makes the provider's database directory.
 mkdir -p "/var/lib/$(value StateDirectory)"
 
 # No floppy drive: a mount that finds no medium.
 stubs=$(mktemp -d)
-printf '#!/bin/sh\nexit 32\n' >"$stubs/mount"
-printf '#!/bin/sh\nexit 0\n' >"$stubs/umount"
-chmod +x "$stubs/mount" "$stubs/umount"
+printf '#!/bin/sh\nexit 32\n' >"$stubs/mount" && printf '#!/bin/sh\n' >"$stubs/umount" && chmod +x "$stubs"/*
 # Called in a subshell each time (command substitution or background), which
 # the daemon then replaces, so $! is the daemon's own process id.
 start() {
@@ -63,10 +58,8 @@ start() {
 }
 
 touch "$workdir/mox.not"
-status=0
-out=$(start 2>&1) || status=$?
-[ "$status" -eq 0 ] || fail "disabled: status $status"
-[ "$out" = "Mox has been disabled." ] || fail "disabled: printed $out"
+out=$(start 2>&1)
+[ "$?:$out" = "0:Mox has been disabled." ] || fail "disabled: printed $out"
 rm "$workdir/mox.not"
 
 log=$(mktemp)
@@ -75,17 +68,13 @@ start >"$log" 2>&1 &
 pid=$!
 # Registration installs the daemon's own MIF into the empty database.
 database=$(printf '%s\n' "${environment[@]}" | sed -n 's/^DMISP_DB=//p')
-for _ in $(seq 50); do
-    grep -l 'Zorek Tessarin Server Manager - Mox' "$database"/component-*.mif >/dev/null 2>&1 && break
-    sleep 0.2
-done
-grep -l 'Zorek Tessarin Server Manager - Mox' "$database"/component-*.mif >/dev/null 2>&1 ||
+timeout 10 bash -c "until grep -qs 'Zorek Tessarin Server Manager - Mox' '$database'/component-*.mif; do sleep 0.2; done" ||
     fail "mox.mif was not installed into $database: $(ls "$database")"
 sleep 1
 kill -0 "$pid" 2>/dev/null || fail "the daemon ended: $(cat "$log")"
 kill -TERM "$pid"
-status=0
-wait "$pid" || status=$?
+wait "$pid"
+status=$?
 elapsed=$(( $(date +%s) - began ))
 [ "$status" -eq 0 ] || fail "after SIGTERM: status $status"
 [ "$elapsed" -ge 10 ] || fail "stopped after $elapsed s, before 10 s"

@@ -9,8 +9,8 @@ source=$1
 page=$source/packaging/mox.8
 
 for p in "$page" "$source/packaging/dmictl.8"; do
-    warnings=$(LC_ALL=C MANWIDTH=80 man -l --warnings=w "$p" 2>&1 >/dev/null) || fail "man -l $p failed"
-    [ -z "$warnings" ] || fail "man -l $p warns: $warnings"
+    warnings=$(LC_ALL=C MANWIDTH=80 man -l --warnings=w "$p" 2>&1 >/dev/null) && [ -z "$warnings" ] ||
+        fail "man -l $p failed or warns: $warnings"
 done
 # One long line per paragraph, no hyphenation, plain ASCII: easy to search.
 text=$(LC_ALL=C MANWIDTH=400 MANROFFOPT=-rHY=0 man -l "$page" 2>/dev/null | col -bx) || fail "man -l failed"
@@ -35,9 +35,7 @@ page_order=$(sed -n '/^MARKER FILES/,/^CONFIGURATION/p' <<<"$text" |
 
 # Exit-status codes 1, 2 and 3 are explained.
 status=$(sed -n '/^EXIT STATUS/,/^ENVIRONMENT/p' <<<"$text")
-for code in 1 2 3; do
-    grep -qE "^ +$code +[a-z]" <<<"$status" || fail "exit code 0x$code not explained"
-done
+for code in 1 2 3; do grep -qE "^ +$code +[a-z]" <<<"$status" || fail "exit code 0x$code not explained"; done
 
 # The table of action codes: the daemon's code-to-handler pairs, in the
 # daemon's run order.

@@ -44,54 +44,45 @@ cp "$out"/mox_2.9[34]_i386.deb "$r/tmp/"
 mkdir -p "$r/run/systemd/system"
 printf '#!/bin/sh\necho "$*" >>/tmp/calls\n' >"$r/usr/bin/deb-systemd-invoke" && chmod 755 "$r/usr/bin/deb-systemd-invoke"
 in_root() { chroot "$r" "$@"; }
-dpkg_do() { in_root dpkg --no-triggers "$@" >"$r/tmp/dpkg.log" 2>&1 || fail "dpkg $*: $(cat "$r/tmp/dpkg.log")"; }
-# state VERSION|- ENABLED(yes|no) : package status and the enablement link.
-link=/etc/systemd/system/multi-user.target.wants/mox.service
-state() {
-    local status
-    status=$(in_root dpkg-query -W -f '${Status} ${Version}' mox 2>/dev/null)
-    [ "$status" = "$1" ] || fail "after $step: status '$status', expected '$1'"
-    if [ "$2" = yes ]; then
-        [ "$(readlink "$r$link")" = /lib/systemd/system/mox.service ] || fail "after $step: no enablement link"
-    else
-        [ ! -e "$r$link" ] && [ ! -L "$r$link" ] || fail "after $step: enablement link present"
-    fi
+# dpkg_do STEP DPKG-ARGUMENTS...
+dpkg_do() {
+    step=$1 && shift
+    in_root dpkg --no-triggers "$@" >"$r/tmp/dpkg.log" 2>&1 || fail "dpkg $*: $(cat "$r/tmp/dpkg.log")"
 }
-calls() { [ "$(cat "$r/tmp/calls" 2>/dev/null)" = "$1" ] || fail "after $step: calls '$(cat "$r/tmp/calls")'"; rm -f "$r/tmp/calls"; }
+# state STATUS LINK-TARGET CALLS: the package status, the enablement link
+# (its target, or nothing at all), the calls of deb-systemd-invoke.
+link=/etc/systemd/system/multi-user.target.wants/mox.service unit=/lib/systemd/system/mox.service
+state() {
+    local got
+    got="$(in_root dpkg-query -W -f '${Status} ${Version}' mox 2>/dev/null)|$(readlink "$r$link" || ls "$r$link" 2>/dev/null)"
+    got+="|$(cat "$r/tmp/calls" 2>/dev/null)"
+    [ "$got" = "$1|$2|$3" ] || fail "after $step: '$got', expected '$1|$2|$3'"
+    rm -f "$r/tmp/calls"
+}
 
-step="install 2.93"
-dpkg_do -i /tmp/mox_2.93_i386.deb
-state "install ok installed 2.93" yes
-calls "start mox.service"
+dpkg_do "install 2.93" -i /tmp/mox_2.93_i386.deb
+state "install ok installed 2.93" $unit "start mox.service"
 for f in $expected_files; do [ -f "$r$f" ] || fail "after $step: no $f"; done
 # What the administrator and the running daemon add.
 echo "notificationonly = true" >"$r/usr/local/ubo/bin/mox.cfg"
 mkdir -p "$r/var/lib/dmisp" && echo database >"$r/var/lib/dmisp/component-1.mif"
 
-step="upgrade to 2.94"
-dpkg_do -i /tmp/mox_2.94_i386.deb
-state "install ok installed 2.94" yes
-calls "restart mox.service"
+dpkg_do "upgrade to 2.94" -i /tmp/mox_2.94_i386.deb
+state "install ok installed 2.94" $unit "restart mox.service"
 
-step="upgrade of a disabled unit"
 rm "$r$link"   # systemctl disable mox
-dpkg_do -i /tmp/mox_2.94_i386.deb
-state "install ok installed 2.94" no
-calls "restart mox.service"
-ln -s /lib/systemd/system/mox.service "$r$link"   # systemctl enable mox
+dpkg_do "upgrade of a disabled unit" -i /tmp/mox_2.94_i386.deb
+state "install ok installed 2.94" "" "restart mox.service"
+ln -s $unit "$r$link"   # systemctl enable mox
 
-step="remove"
-dpkg_do -r mox
-state "deinstall ok config-files 2.94" yes
-calls "stop mox.service"
+dpkg_do remove -r mox
+state "deinstall ok config-files 2.94" $unit "stop mox.service"
 [ "$(readlink "$r/etc/systemd/system/mox.service")" = /dev/null ] || fail "after $step: the unit is not masked"
 for f in /usr/local/ubo/bin/mox /lib/systemd/system/mox.service; do [ ! -e "$r$f" ] || fail "after $step: $f left"; done
-[ -f "$r/usr/local/ubo/bin/mox.cfg" ] || fail "after $step: mox.cfg removed"
-[ -f "$r/var/lib/dmisp/component-1.mif" ] || fail "after $step: the provider database removed"
+for f in /usr/local/ubo/bin/mox.cfg /var/lib/dmisp/component-1.mif; do [ -f "$r$f" ] || fail "after $step: $f removed"; done
 
-step="purge"
-dpkg_do -P mox
-state "" no
+dpkg_do purge -P mox
+state "" "" ""
 for f in /etc/systemd/system/mox.service /var/lib/systemd/deb-systemd-helper-enabled/mox.service.dsh-also \
     /var/lib/dmisp; do [ ! -e "$r$f" ] && [ ! -L "$r$f" ] || fail "after $step: $f left"; done
 [ -f "$r/usr/local/ubo/bin/mox.cfg" ] || fail "after $step: the administrator's mox.cfg removed"
