@@ -31,10 +31,9 @@ TEST(Dispatch, RunOrderSwitchPositionsAndFirstMatch)
                                         {20, [](SLHandle*, EventRecord*) { return calls += "20 ", 0; }}, {0, nullptr}};
     const ActionEntry* saved = actionsSetHandlers(table);
     EventRecord record{};
-    DoAction(8, 0, nullptr, &record);  // switched off
-    DoAction(8, 1, nullptr, &record);  // first match only
-    DoAction(20, 5, nullptr, &record); // any non-zero switch
-    DoAction(17, 1, nullptr, &record); // the alert name is no action
+    // Switched off; first match only; any non-zero switch; the alert name is no action.
+    for (auto [code, position] : {std::pair{8u, 0u}, {8u, 1u}, {20u, 5u}, {17u, 1u}})
+        DoAction(code, position, nullptr, &record);
     actionsSetHandlers(saved);
     EXPECT_EQ(calls, "8 20 ");
 }
@@ -52,14 +51,11 @@ TEST_F(SystemActions, CapabilityCodeAndDelayOfEachWrapper)
         {"shutdownAndresetsystem", shutdownAndresetsystem, 0x10, 0x30, "shutdown code 1 delay 400; ", 1},
         {"powerOff", powerOff, 0x01, 0x01, armed + "power down" + started, 0},
         {"resetSystem", resetSystem, 0x02, 0x02, armed + "hard reset" + started, 0},
-        {"issueNMI", issueNMI, 0x04, 0x04, "chassis control: nmi; ", 0},
-    };
-    moxSetShutDownFunction([] { return ++shutDowns, -1; });
-    moxSetSleepHook([](unsigned) {});
+        {"issueNMI", issueNMI, 0x04, 0x04, "chassis control: nmi; ", 0}};
+    moxSetShutDownFunction([] { return ++shutDowns, -1; }), moxSetSleepHook([](unsigned) {});
     for (const Row& row : rows) {
         for (int run = 0; run < 3; ++run) { // allowed; its bit missing; notifications only
-            SetUp();
-            shutDowns = 0;
+            SetUp(), shutDowns = 0;
             MoxActionCapabilityWord = run == 1 ? 0x7FF & ~row.bit : run == 0 ? row.word : 0x7FF;
             bNotificationOnly = run == 2 ? 1 : 0;
             EXPECT_EQ(row.handler(nullptr, nullptr), 0);
@@ -67,10 +63,8 @@ TEST_F(SystemActions, CapabilityCodeAndDelayOfEachWrapper)
             EXPECT_EQ(shutDowns, run == 0 ? row.shutDowns : 0) << row.name << " " << run;
         }
     }
-    moxSetShutDownFunction(nullptr);
-    moxSetSleepHook(nullptr);
-    MoxActionCapabilityWord = 0x7FF;
-    bNotificationOnly = 0;
+    moxSetShutDownFunction(nullptr), moxSetSleepHook(nullptr);
+    MoxActionCapabilityWord = 0x7FF, bNotificationOnly = 0;
 }
 
 TEST(Notify, LogLinesAndPriorities)
@@ -85,8 +79,7 @@ TEST(Notify, LogLinesAndPriorities)
         {EVENT_STANDARD, 2, &valueless, LOG_INFO, ""}, // a key without a value is never read
         {EVENT_STANDARD, 4, nullptr, LOG_INFO, ""}, {EVENT_STANDARD, 8, nullptr, LOG_WARNING, ""},
         {EVENT_STANDARD, 16, nullptr, LOG_ERR, ""}, {EVENT_STANDARD, 32, nullptr, LOG_ERR, ""},
-        {EVENT_UNKNOWN, 1, nullptr, LOG_NOTICE, "DMI Unknown Indication Unknown\n"},
-    };
+        {EVENT_UNKNOWN, 1, nullptr, LOG_NOTICE, "DMI Unknown Indication Unknown\n"}};
     moxSetLogHook([](int priority, const char* text) { lines.emplace_back(priority, text); });
     for (const Row& row : rows) {
         lines.clear();
@@ -157,8 +150,7 @@ TEST(OsServices, ShutdownExecutesInitZeroWithNoBlockedSignals)
     wait(&status);
     std::ifstream in(dir + "/record");
     EXPECT_EQ(std::string(std::istreambuf_iterator<char>(in), {}), "init 0 /0000000000000000\n") << status;
-    moxSetLogHook([](int priority, const char* t) { lines.emplace_back(priority, t); });
-    lines.clear();
+    moxSetLogHook([](int priority, const char* t) { lines.emplace_back(priority, t); }), lines.clear();
     EXPECT_EQ(shutDownOsWith("/nonexistent/init"), -1);
     moxSetLogHook(nullptr);
     EXPECT_EQ(lines, (decltype(lines){{LOG_ERR, "MOX - cannot execute /nonexistent/init for the OS shutdown: No such "

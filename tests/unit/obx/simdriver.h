@@ -8,11 +8,9 @@
 #include "obx/obxapi.h"
 #include "obxdrv/obxsim.h"
 
-inline void* simMmap(void* address, size_t length, int protection, int flags, int fd, off_t offset)
-{
-    return obxsimMmap(address, length, protection, flags, fd, static_cast<int64_t>(offset));
-}
-inline const ObxOs simOs = {obxsimOpen, obxsimIoctl, simMmap, obxsimMunmap, obxsimClose};
+inline const ObxOs simOs = {obxsimOpen, obxsimIoctl, [](void* address, size_t length, int protection, int flags, int fd,
+    off_t offset) { return obxsimMmap(address, length, protection, flags, fd, static_cast<int64_t>(offset)); },
+    obxsimMunmap, obxsimClose};
 
 class SimDriverTest : public ::testing::Test {
 protected:

@@ -5,12 +5,64 @@
 
 #include <algorithm>
 #include <chrono>
+#include <cstdlib>
+#include <cstring>
 #include <map>
 #include <thread>
 
-#include "scripted_provider.h"
+#include "base/sleep.h"
+#include "dmisp/dmisp.h"
+#include "sl/sl.h"
+#include "sl/slaccess.h"
+#include "sl/slevent.h"
+#include "sl/slhandle.h"
+#include "sl/slkey.h"
+#include "sl/slmap.h"
+#include "sl/slstring.h"
 
 namespace {
+
+// An in-process DMI provider that keeps a copy of every command block it is
+// handed and answers as `responder` says, confirming before DmiInvoke returns.
+// A reply: DmiInvoke's result (0 accepted, 529 busy, else refused), the confirm status (word 11), whether a
+// confirm comes at all, and what to write into the confirm.
+struct Reply { uint32_t invoke = 0, status = 0; bool confirm = true; std::function<void(uint8_t*)> fill = nullptr; };
+
+std::string text(const DmiString* s) { return s ? std::string(dmiStringText(s), dmiStringLength(s)) : "null"; }
+
+// Writes a DMI string at `offset` of `base`.
+void putString(uint8_t* base, uint32_t offset, const std::string& s)
+{
+    storeWord(base + offset, static_cast<uint32_t>(s.size())), std::memcpy(base + offset + 4, s.data(), s.size());
+}
+
+struct ScriptedProvider {
+    static inline ScriptedProvider* provider = nullptr; // the one in use
+    std::function<Reply(const uint8_t* block)> responder = [](const uint8_t*) { return Reply{}; };
+    std::vector<std::vector<uint8_t>> blocks;
+    std::vector<unsigned> sleeps; // requested through the sleep hook
+    bool cleaned = false;
+
+    ScriptedProvider()
+    {
+        provider = this;
+        moxSetSleepHook([](unsigned ms) { provider->sleeps.push_back(ms); }), SLInitialize();
+        SLDmiInvoke = [](void* command) {
+            auto* block = static_cast<uint8_t*>(command);
+            provider->blocks.emplace_back(block, block + SL_COMMAND_SIZE);
+            Reply reply = provider->responder(block);
+            if (reply.invoke == 0 && reply.confirm && reply.fill)
+                reply.fill(static_cast<uint8_t*>(wordPointer(loadWordAt(block, 8))));
+            storeWordAt(block, 11, reply.status);
+            if (reply.invoke == 0 && reply.confirm && loadWordAt(block, 1) < 1024) // 1024-1027 are final at once
+                dmiConfirmFunc(block);
+            return reply.invoke;
+        };
+    }
+    ~ScriptedProvider() { cleanup(), moxSetSleepHook(nullptr); }
+    void cleanup() { cleaned = cleaned || (SLCleanup(), true); }
+    uint32_t word(size_t block, uint32_t index) const { return loadWordAt(blocks.at(block).data(), index); }
+};
 
 using Words = std::vector<uint32_t>; // word index, value, index, value ...
 
@@ -40,22 +92,12 @@ TEST(SLCommand, BlocksOfEveryCommand)
     SLKeyList ten = keyList({entries.begin(), entries.end() - 1}), eleven = keyList(entries);
     std::string tooLong(SL_COMMAND_SIZE, 'x');
     std::vector<uint8_t> fits(SL_COMMAND_SIZE - 88 - 24 - 7 - 4); // behind the two keys and their values
-    struct Row {
-        const char* name;
-        std::function<int()> call;
-        uint32_t code;
-        Words words = {};
-        std::pair<uint32_t, std::string> bytes = {};
-    } rows[] = {CMD(SLDmiUnregisterMgmt(h), 257), CMD(SLCancel(h), 258),
+    struct Row { const char* name; std::function<int()> call; uint32_t code; Words words = {};
+        std::pair<uint32_t, std::string> bytes = {}; } rows[] = {CMD(SLDmiUnregisterMgmt(h), 257), CMD(SLCancel(h), 258),
         CMD(SLListComponent(h, nullptr, 7), 512, {16, 7, 17, 0, 18, 0}), CMD(SLListComponent(h, tooLong.data(), 1), 0),
         CMD(SLListComponent(h, "Zo", 7), 512, {17, 80, 20, 2}, {84, "Zo"}),
         CMD(SLListFirstComponent(h, nullptr), 513, {16, 0, 17, 0}), CMD(SLListNextComponent(h, 0, 7), 514, {16, 7}),
-        CMD(SLListComponentDesc(h, 7), 515, {16, 7, 19, 0}), CMD(SLListGroup(h, 7, 3), 516, {16, 7, 17, 3}),
-        CMD(SLListFirstGroup(h, 7), 517, {16, 7}), CMD(SLListNextGroup(h, 7, 3), 518, {16, 7, 17, 3}),
-        CMD(SLListGroupDesc(h, 7, 3), 519, {16, 7, 17, 3, 19, 0}),
-        CMD(SLListAttribute(h, 7, 3, 2), 520, {16, 7, 17, 3, 18, 2}),
-        CMD(SLListFirstAttribute(h, 7, 3), 521, {16, 7, 17, 3}),
-        CMD(SLListNextAttribute(h, 7, 3, 2), 522, {16, 7, 17, 3, 18, 2}),
+        CMD(SLListComponentDesc(h, 7), 515, {16, 7, 19, 0}), CMD(SLListNextGroup(h, 7, 3), 518, {16, 7, 17, 3}),
         CMD(SLListAttributeDesc(h, 7, 3, 2), 523, {16, 7, 17, 3, 18, 2, 19, 0}),
         CMD(SLGetAttribute(h, 7, 3, 2, nullptr), 768, {16, 7, 17, 3, 18, 0, 19, 0, 20, 2}),
         CMD(SLGetAttribute(h, 7, 3, 2, &k), 768,
@@ -170,8 +212,7 @@ TEST(SLAccess, EveryLayout)
     SLHandle* rows1 = confirmOf(1, event, {{500, "EventGeneration|x"}}, 510);
     event[9] = 400;
     SLHandle* rows2 = confirmOf(1, event, {{500, "EventGeneration|x"}}, 560, 0x444D4932);
-    SLEventSelectRowCnf(rows1, 0, 1);
-    SLEventSelectRowCnf(rows2, 0, 1);
+    SLEventSelectRowCnf(rows1, 0, 1), SLEventSelectRowCnf(rows2, 0, 1);
     std::tuple<const char*, std::function<std::string()>, std::string> rows[] = {A(comp, SLComponentId, "7"),
         A(comp, SLComponentName, "Board"), A(comp, SLComponentGroupCount, "2"), A(comp, SLComponentGroupId, "2", 1),
         A(comp, SLComponentGroupName, "G2", 1), A(comp, SLComponentGroupId, "0", 0x7FFFFFFF),
@@ -207,8 +248,8 @@ TEST(SLKey, Compare)
         {"other id", key(5, &one), key(5, &one, 2), 0}, {"one without value", key(5, nullptr), key(5, &one), 0},
         {"both without value", key(5, nullptr), key(5, nullptr), 1}, {"same string", key(8, abc), key(8, abc), 1},
         {"other string", key(7, abc), key(7, abd), 0}, {"64-bit not compared", key(6, big1), key(6, big2), 1},
-        {"other count", key(5, &one), keyList({}), 0},
-        {"eleven keys", keyList(std::vector<SLKeyEntry>(11)), keyList(std::vector<SLKeyEntry>(11)), 0}};
+        {"other count", key(5, &one), keyList({}), 0}, {"eleven keys", keyList(std::vector<SLKeyEntry>(11)),
+        keyList(std::vector<SLKeyEntry>(11)), 0}};
     for (auto& [name, a, b, equal] : rows)
         EXPECT_EQ(SLCompareKeyLists(&a, &b), equal) << name;
 }
@@ -256,24 +297,12 @@ TEST(SLCleanup, LetsWaitingCommandsLeave)
 std::atomic<bool> hold{false};
 std::atomic<int> handled{0}, completions{0};
 
-int handler(SLHandle*)
-{
-    for (++handled; hold;)
-        std::this_thread::yield();
-    return 0;
-}
-
-void completion(void*)
-{
-    for (++completions; hold;)
-        std::this_thread::yield();
-}
-
-// An event indication stating `length` bytes, with the completion above.
+// An event indication stating `length` bytes, whose completion counts itself and waits while held.
 std::vector<uint32_t> event(uint32_t length)
 {
     std::vector<uint32_t> w(20, 0xABABABAB);
-    w[1] = 1, w[2] = length, w[11] = pointerWord(reinterpret_cast<void*>(&completion));
+    void (*completion)(void*) = [](void*) { for (++completions; hold;) std::this_thread::yield(); };
+    w[1] = 1, w[2] = length, w[11] = pointerWord(reinterpret_cast<void*>(completion));
     return w;
 }
 
@@ -283,11 +312,10 @@ std::vector<uint32_t> event(uint32_t length)
 TEST(SLEvent, Delivery)
 {
     ScriptedProvider p;
-    SLEventSetHandler(handler);
+    SLEventSetHandler([](SLHandle*) { for (++handled; hold;) std::this_thread::yield(); return 0; });
     for (uint32_t length : {51u, (1u << 20) + 1}) { // shorter than the header, above 1 MiB
         int before = completions;
-        std::vector<uint32_t> indication = event(length);
-        SLIndicationFunc(indication.data()); // a handled one would be completed later, by its event thread
+        SLIndicationFunc(event(length).data()); // a handled one would be completed later, by its event thread
         EXPECT_EQ(completions.load(), before + 1) << length;
     }
     auto expectWaits = [](std::atomic<int>& entered, const std::function<void()>& act) {
@@ -309,6 +337,62 @@ TEST(SLEvent, Delivery)
     };
     expectWaits(handled, [] { SLEventSetHandler(nullptr); });
     expectWaits(completions, [&] { p.cleanup(); });
+}
+
+// The substitute provider's contract: the confirms and indications it writes
+// read through the SL accessors as the daemon reads them. The end-to-end
+// testbed is worth what this table pins.
+const char board[] = R"(start component name = "Test Board"
+  start group name = "Voltage Events" class = "EventGeneration|Voltage Probe|001" id = 20
+    start attribute name = "Event Type" id = 1 type = integer value = 2 end attribute
+  end group
+  start group name = "Voltage Probe" class = "DMTF|Voltage Probe|001" key = 1
+    start attribute name = "Index" id = 1 type = integer end attribute
+    start attribute name = "Label" id = 2 type = displaystring(16) end attribute
+  end group
+  start table name = "Voltage Probe" class = "DMTF|Voltage Probe|001" id = 30 {1, "CPU"} {2, "Memory"} end table
+end component)";
+
+std::string str(uint32_t n) { return std::to_string(static_cast<int32_t>(n)) + " "; }
+std::string seen;
+
+
+TEST(ProviderContract, ConfirmsAndIndicationsReadThroughTheAccessors)
+{
+    char dir[] = "/tmp/sl-contract-XXXXXX";
+    ASSERT_TRUE(mkdtemp(dir) && dmisp::reset(dir, false) == 0);
+    SLInitialize();
+    SLHandle* h = SLCreateHandle(0);
+    ASSERT_EQ(SLDmiRegisterMgmt(h, [](SLHandle* e) { // events only: class 1 is the row behind the event-generation row
+        SLEventSelectRowCnf(e, 1, 0);
+        if (SLIndicationType(e) == 1)
+            seen = str(SLEventClassCount(e)) + str(SLKeyCount(e)) + str(SLRowGroupId(e)) + text(SLRowStringPtr(e, 1)) +
+                " " + text(SLEventClassString(e, 0));
+        return 0; }), 0);
+    uint32_t c = dmisp::installText(board, "board.mif");
+    SLKeyList* keys = nullptr;
+    std::tuple<const char*, std::function<int()>, std::function<std::string()>, std::string> rows[] = {
+        {"group", [&] { return SLListGroup(h, c, 30); },
+            [&] { return str(SLKeyCount(h)) + text(SLGroupName(h, 0)) + "/" + text(SLGroupClassName(h, 0)); },
+            "1 Voltage Probe/DMTF|Voltage Probe|001"},
+        {"first row", [&] { return SLGetFirstRow(h, c, 30, 0, nullptr); },
+            [&] { return str(SLRowGroupId(h)) + str(SLRowAttributeCount(h)) + str(SLRowIntegerValue(h, 0)) +
+                      text(SLRowStringPtr(h, 1)); }, "30 2 1 CPU"},
+        {"get by the row's keys", [&] { return SLGetAttribute(h, c, 30, 2, keys = SLCreateKeyList(h)); },
+            [&] { return str(SLAttributeType(h, 0)) + text(SLStringPtr(h)); }, "8 CPU"},
+        {"next row by keys", [&] { return SLGetNextRow(h, c, 30, 0, keys); },
+            [&] { return str(SLRowIntegerValue(h, 0)) + text(SLRowStringPtr(h, 1)); }, "2 Memory"}};
+    for (const auto& [name, command, read, want] : rows) {
+        ASSERT_EQ(command(), 0) << name << ": status " << SLCnfStatus(h);
+        EXPECT_EQ(read(), want) << name;
+    }
+    for (uint32_t level : {SL_LEVEL_CHECK, 0u}) { // rows back to back, or an array of their offsets
+        dmisp::setIndicationLevelCheck(level);
+        ASSERT_TRUE(dmisp::raiseEvent(c, {20, {}}, {30, {"2"}}) == 0 && dmisp::waitIndicationsCompleted());
+        EXPECT_EQ(seen, "2 1 30 Memory EventGeneration|Voltage Probe|001") << "level check " << level;
+    }
+    SLDmiUnregisterMgmt(h), dmisp::shutdown(), SLCleanup();
+    EXPECT_EQ(std::system(("rm -rf " + std::string(dir)).c_str()), 0);
 }
 
 } // namespace

@@ -43,21 +43,17 @@ TEST(Smtp, DialogueStagesAndFailureLines)
          "HELO 127.0.0.1\r\nMAIL FROM:<a@x  RSET>\r\nRCPT TO:<b@y>\r\nRCPT TO:< c@z>\r\nRCPT TO:<d@w>\r\nDATA\r\n"
          "SUBJECT:s t\r\none\r\n..two\r\nthr ee\r\n.\r\nQUIT\r\n",
          "", 1000, "a@x\r\nRSET", "b@y, c@z;;d@w", "s\nt", "one\n.two\r\nthr\x01" "ee"},
-        {"greeting", upTo(0, "421 busy\r\n"), sent(0), failed(5, 421)},
-        {"HELO", upTo(1, "500 no\r\n"), sent(1), failed(8, 500)},
-        {"MAIL", upTo(2, "550 no\r\n"), sent(2), failed(11, 550)},
-        {"RCPT", upTo(3, "251 fwd\r\n"), sent(3), failed(14, 251)},
+        {"greeting", upTo(0, "421 busy\r\n"), sent(0), failed(5, 421)}, {"HELO", upTo(1, "500 no\r\n"), sent(1), failed(8, 500)},
+        {"MAIL", upTo(2, "550 no\r\n"), sent(2), failed(11, 550)}, {"RCPT", upTo(3, "251 fwd\r\n"), sent(3), failed(14, 251)},
         {"DATA", upTo(4, "554 no\r\n"), sent(4), failed(17, 554)},
         {"subject answered", upTo(4, "354 go\r\n", {{"SUBJECT:s\r\n", "250 ok\r\n"}}), sent(5), failed(20, 250)},
-        {"body", upTo(5, "451 later\r\n"), sent(6), failed(23, 451)},
-        {"QUIT", upTo(6, "500 no\r\n"), sent(7), failed(26, 500)},
+        {"body", upTo(5, "451 later\r\n"), sent(6), failed(23, 451)}, {"QUIT", upTo(6, "500 no\r\n"), sent(7), failed(26, 500)},
         {"recipient never writable", upTo(2, "250 ok\r\n"), sent(2),
          socketsLine + "110,Reason:Mox email alert was not sent A communication error occured... The last command "
                        "returned the following values:12, 110\n\n", 2},
         {"connection refused", {}, "",
          socketsLine + "111,Reason:Mox email alert was not sent Unable to connect to SMTP server[127.0.0.1] The last "
-                       "command returned the following values:3, 111\n\n"},
-    };
+                       "command returned the following values:3, 111\n\n"}};
     moxSetLogHook(LogCapture::hook), moxSetSleepHook(SleepCapture::hook), smtpSetLimitMs(300);
     smtpSetWritableHook([](int, int) { return writable-- > 0; });
     for (Row& row : rows) {
@@ -68,14 +64,12 @@ TEST(Smtp, DialogueStagesAndFailureLines)
         smtpSetPort(peer ? peer->port() : 1);
         writable = row.writable;
         std::string server = "127.0.0.1";
-        EmailConfig config{server.data(), row.sender.data(), row.recipients.data(), row.subject.data(),
-                           row.body.data()};
+        EmailConfig config{server.data(), row.sender.data(), row.recipients.data(), row.subject.data(), row.body.data()};
         testing::internal::CaptureStderr();
         EXPECT_EQ(_MoxSendEmail(&config), row.log.empty() ? 1 : 0);
         std::string err = testing::internal::GetCapturedStderr();
         EXPECT_EQ(peer ? peer->received() : "", row.received);
-        using Lines = std::vector<std::pair<int, std::string>>;
-        EXPECT_EQ(LogCapture::take(), (row.log.empty() ? Lines{} : Lines{{LOG_INFO, row.log}}));
+        EXPECT_EQ(LogCapture::take(), (row.log.empty() ? decltype(LogCapture::lines){} : decltype(LogCapture::lines){{LOG_INFO, row.log}}));
         EXPECT_EQ(err.empty(), row.log.empty()) << err;
     }
     moxSetLogHook(nullptr), moxSetSleepHook(nullptr), smtpSetWritableHook(nullptr);
@@ -84,15 +78,10 @@ TEST(Smtp, DialogueStagesAndFailureLines)
 TEST(Smtp, ReplyPiecesAndLineEnds)
 {
     struct Row { std::vector<std::string> pieces; int gapMs, size, length; std::string text; } rows[] = {
-        {{"22", "0 mx", "\r\n"}, 50, 1024, 8, "220 mx\r\n"},
-        {{"250 a\n\n"}, 0, 1024, 7, "250 a\n\n"},
-        {{"250 a\n\r"}, 0, 1024, 7, "250 a\n\r"},
-        {{"250 a\r\r"}, 0, 1024, 7, "250 a\r\r"},
-        {{"250 a\n"}, 0, 1024, 0, ""},                            // one line feed ends nothing
-        {{std::string("250 a\0b\r\n", 9)}, 0, 1024, 5, "250 a"}, // up to a NUL
+        {{"22", "0 mx", "\r\n"}, 50, 1024, 8, "220 mx\r\n"}, {{"250 a\n\n"}, 0, 1024, 7, "250 a\n\n"},
+        {{"250 a\n"}, 0, 1024, 0, ""}, {{std::string("250 a\0b\r\n", 9)}, 0, 1024, 5, "250 a"}, // one LF: nothing; a NUL ends
         {{"250 a\r\n"}, 0, 4, 3, "250"},                          // cut to the caller's size
-        {{"2", "5", "0", " ", "a", "\r", "\n"}, 60, 1024, 0, ""}, // one limit for the whole reply
-    };
+        {{"2", "5", "0", " ", "a", "\r", "\n"}, 60, 1024, 0, ""}}; // one limit for the whole reply
     smtpSetLimitMs(300);
     for (const Row& row : rows) {
         int ends[2];

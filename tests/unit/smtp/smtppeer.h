@@ -9,7 +9,6 @@
 #include <string>
 #include <thread>
 #include <unistd.h>
-#include <utility>
 #include <vector>
 
 #include "base/log.h"
@@ -31,7 +30,7 @@ public:
         thread_ = std::thread([this, script] { run(script); });
     }
     ~ScriptedServer() { received(), close(listener_); }
-    uint16_t port() const { return port_; }
+    uint16_t port() const { return static_cast<uint16_t>(port_); }
     const std::string& received() { return thread_.joinable() ? thread_.join(), received_ : received_; }
 
 private:
@@ -56,12 +55,10 @@ private:
             cursor = found + awaited.size();
             send(fd, reply.data(), reply.size(), MSG_NOSIGNAL);
         }
-        while (fd >= 0 && readSome(fd))
-            continue;
+        while (fd >= 0 && readSome(fd)) {}
         close(fd);
     }
-    int listener_ = -1;
-    uint16_t port_ = 0;
+    int listener_ = -1, port_ = 0;
     std::thread thread_;
     std::string received_;
 };
@@ -81,7 +78,4 @@ struct LogCapture {
     static void hook(int priority, const char* text) { lines.emplace_back(priority, text); }
     static std::vector<std::pair<int, std::string>> take() { return std::exchange(lines, {}); }
 };
-struct SleepCapture {
-    static inline std::vector<unsigned> sleeps;
-    static void hook(unsigned ms) { sleeps.push_back(ms); }
-};
+struct SleepCapture { static inline std::vector<unsigned> sleeps; static void hook(unsigned ms) { sleeps.push_back(ms); } };
