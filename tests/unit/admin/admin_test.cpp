@@ -21,7 +21,7 @@ std::string logged;
 TEST(Admin, ActionLogOption)
 {
     struct Case { const char* content; uint32_t notificationOnly, actionLog; } cases[] = {
-        {"ActionLog = TRUE\nnotificationonly = off\n", 0, 1},
+        {"notificationonly = true\nActionLog = TRUE\nnotificationonly = off\n", 0, 1},
         {"actionlog = true\nactionlog = no\nnotificationonly = true\n", 1, 0},
         {"#actionlog = true\n", 0, 0}};
     const std::string path = "/tmp/moxadmin" + std::to_string(getpid());
