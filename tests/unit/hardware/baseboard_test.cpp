@@ -3,6 +3,7 @@
 #include <cstring>
 
 #include "base/bytes.h"
+#include "daemon/events.h"
 #include "provider.h"
 
 namespace {
@@ -28,6 +29,11 @@ protected:
 TEST_F(Baseboard, DisplayLineOfThirtyTwoCharactersInTheFirstListedForm)
 {
     withBaseboard({});
+    // A component-install indication makes the worker look for the groups again.
+    SLHandle* installed = SLCreateHandle(0);
+    memset(installed->command, 0, SL_COMMAND_SIZE), memset(installed->confirm, 0, 64);
+    storeWordAt(installed->command, 1, 2), processEvent(installed), SLDestroyHandle(installed);
+    EXPECT_NE(LcdGroupId, 0u);
     ASSERT_EQ(LcdInitialize(), 0);
     for (std::string text : {"Fan failed", "0123456789012345678901234567890123456789", ""}) {
         std::string line = (text + std::string(32, ' ')).substr(0, 32);

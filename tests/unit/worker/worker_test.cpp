@@ -218,7 +218,7 @@ TEST(WorkerTeardown, CleanupWaitsAndUnloadReturns)
 
     // unload while the worker waits for a confirm that never comes
     if (fork() == 0) {
-        alarm(15);
+        alarm(60); // a hang, not a slow machine (sanitizers under an emulator)
         state = 0;
         SLInitialize();
         SLDmiInvoke = [](void*) -> uint32_t { return 0; }; // accepted, never confirmed
