@@ -1,6 +1,8 @@
 #include "dmisp/control.h"
 
 #include <cerrno>
+#include <chrono>
+#include <condition_variable>
 #include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
@@ -12,6 +14,7 @@
 #include <unistd.h>
 
 #include "base/bytes.h"
+#include "dmisp/database.h"
 #include "dmisp/dmisp.h"
 
 namespace dmisp {
@@ -20,74 +23,114 @@ namespace {
 
 constexpr uint32_t MaxArguments = 256;
 constexpr uint32_t MaxArgument = 1u << 20;
+// A request must have arrived whole this long after it was accepted, and the
+// reply must have left this long after it was ready.
+constexpr int RequestDeadlineMs = 5000;
+// Requests served at once; a client beyond them is closed at once.
+constexpr unsigned MaxClients = 32;
+// The client gives up on a provider that has not answered in this time.
+constexpr int ClientDeadlineMs = 10000;
+
+using Clock = std::chrono::steady_clock;
 
 std::mutex g_controlMu; // guards the fields below
+std::condition_variable g_clientsDone;
 int g_listenFd = -1;
 int g_stopPipe[2] = {-1, -1};
 pthread_t g_thread;
 std::string g_path;
+unsigned g_clients = 0; // serving threads running
 
 // ---- wire helpers ------------------------------------------------------------------
 
-bool writeAll(int fd, const void* data, size_t n)
+// Waits until fd is ready for `events` or the deadline passes; false then, or
+// when the provider stops (the stop pipe, when given, became readable).
+bool waitReady(int fd, short events, Clock::time_point deadline, int stopFd)
 {
-    const char* p = static_cast<const char*>(data);
-    while (n > 0) {
-        ssize_t w = ::send(fd, p, n, MSG_NOSIGNAL);
-        if (w < 0 && errno == EINTR)
-            continue;
-        if (w <= 0)
+    for (;;) {
+        auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - Clock::now()).count();
+        if (left <= 0)
             return false;
-        p += w;
-        n -= static_cast<size_t>(w);
-    }
-    return true;
-}
-
-bool readAll(int fd, void* data, size_t n)
-{
-    char* p = static_cast<char*>(data);
-    while (n > 0) {
-        ssize_t r = ::recv(fd, p, n, 0);
-        if (r < 0 && errno == EINTR)
+        struct pollfd fds[2] = {{fd, events, 0}, {stopFd, POLLIN, 0}};
+        int n = ::poll(fds, stopFd >= 0 ? 2 : 1, static_cast<int>(left));
+        if (n < 0 && errno == EINTR)
             continue;
-        if (r <= 0)
+        if (n < 0 || (stopFd >= 0 && fds[1].revents != 0))
             return false;
-        p += r;
-        n -= static_cast<size_t>(r);
+        if (n > 0)
+            return true;
     }
-    return true;
 }
 
-bool writeWord(int fd, uint32_t v)
-{
-    uint8_t b[4];
-    storeWord(b, v);
-    return writeAll(fd, b, 4);
-}
+struct Wire {
+    int fd;
+    Clock::time_point deadline;
+    int stopFd = -1;
 
-bool readWord(int fd, uint32_t* v)
-{
-    uint8_t b[4];
-    if (!readAll(fd, b, 4))
-        return false;
-    *v = loadWord(b);
-    return true;
-}
+    bool writeAll(const void* data, size_t n)
+    {
+        const char* p = static_cast<const char*>(data);
+        while (n > 0) {
+            if (!waitReady(fd, POLLOUT, deadline, stopFd))
+                return false;
+            ssize_t w = ::send(fd, p, n, MSG_NOSIGNAL | MSG_DONTWAIT);
+            if (w < 0 && (errno == EINTR || errno == EAGAIN))
+                continue;
+            if (w <= 0)
+                return false;
+            p += w;
+            n -= static_cast<size_t>(w);
+        }
+        return true;
+    }
 
-bool writeText(int fd, const std::string& s)
-{
-    return writeWord(fd, static_cast<uint32_t>(s.size())) && writeAll(fd, s.data(), s.size());
-}
+    bool readAll(void* data, size_t n)
+    {
+        char* p = static_cast<char*>(data);
+        while (n > 0) {
+            if (!waitReady(fd, POLLIN, deadline, stopFd))
+                return false;
+            ssize_t r = ::recv(fd, p, n, MSG_DONTWAIT);
+            if (r < 0 && (errno == EINTR || errno == EAGAIN))
+                continue;
+            if (r <= 0)
+                return false;
+            p += r;
+            n -= static_cast<size_t>(r);
+        }
+        return true;
+    }
 
-bool readText(int fd, std::string* s)
-{
-    uint32_t n;
-    if (!readWord(fd, &n) || n > MaxArgument)
-        return false;
-    s->resize(n);
-    return n == 0 || readAll(fd, s->data(), n);
-}
+    bool writeWord(uint32_t v)
+    {
+        uint8_t b[4];
+        storeWord(b, v);
+        return writeAll(b, 4);
+    }
+
+    bool readWord(uint32_t* v)
+    {
+        uint8_t b[4];
+        if (!readAll(b, 4))
+            return false;
+        *v = loadWord(b);
+        return true;
+    }
+
+    bool writeText(const std::string& s)
+    {
+        return writeWord(static_cast<uint32_t>(s.size())) && writeAll(s.data(), s.size());
+    }
+
+    bool readText(std::string* s)
+    {
+        uint32_t n;
+        if (!readWord(&n) || n > MaxArgument)
+            return false;
+        s->resize(n);
+        return n == 0 || readAll(s->data(), n);
+    }
+};
 
 bool fillAddress(const std::string& path, struct sockaddr_un* a)
 {
@@ -99,21 +142,38 @@ bool fillAddress(const std::string& path, struct sockaddr_un* a)
     return true;
 }
 
-void serveOne(int fd)
+// Serves one connection on a thread of its own: however slowly a client
+// sends, its request has one deadline, and it delays nobody else.
+void* serveClient(void* arg)
 {
-    struct timeval tv = {5, 0};
-    ::setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv);
+    int fd = static_cast<int>(reinterpret_cast<intptr_t>(arg));
+    int stopFd;
+    {
+        std::lock_guard<std::mutex> lock(g_controlMu);
+        stopFd = g_stopPipe[0];
+    }
+    Wire wire{fd, Clock::now() + std::chrono::milliseconds(RequestDeadlineMs), stopFd};
     uint32_t argc;
-    if (!readWord(fd, &argc) || argc > MaxArguments)
-        return;
-    std::vector<std::string> args(argc);
-    for (std::string& a : args)
-        if (!readText(fd, &a))
-            return;
-    std::string out;
-    int code = runControl(args, &out);
-    if (writeWord(fd, static_cast<uint32_t>(code)))
-        writeText(fd, out);
+    std::vector<std::string> args;
+    bool whole = wire.readWord(&argc) && argc <= MaxArguments;
+    if (whole) {
+        args.resize(argc);
+        for (std::string& a : args)
+            if (!(whole = wire.readText(&a)))
+                break;
+    }
+    if (whole) {
+        std::string out;
+        int code = runControl(args, &out);
+        wire.deadline = Clock::now() + std::chrono::milliseconds(RequestDeadlineMs);
+        if (wire.writeWord(static_cast<uint32_t>(code)))
+            wire.writeText(out);
+    }
+    ::close(fd);
+    std::lock_guard<std::mutex> lock(g_controlMu);
+    --g_clients;
+    g_clientsDone.notify_all();
+    return nullptr;
 }
 
 void* controlThread(void*)
@@ -127,13 +187,24 @@ void* controlThread(void*)
         }
         if (fds[1].revents != 0)
             break;
-        if (fds[0].revents & POLLIN) {
-            int fd = ::accept4(g_listenFd, nullptr, nullptr, SOCK_CLOEXEC);
-            if (fd >= 0) {
-                serveOne(fd);
-                ::close(fd);
-            }
+        if ((fds[0].revents & POLLIN) == 0)
+            continue;
+        int fd = ::accept4(g_listenFd, nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK);
+        if (fd < 0)
+            continue;
+        std::lock_guard<std::mutex> lock(g_controlMu);
+        pthread_attr_t attr;
+        pthread_t thread;
+        bool started = g_clients < MaxClients && pthread_attr_init(&attr) == 0;
+        if (started) {
+            pthread_attr_setdetachstate(&attr, PTHREAD_CREATE_DETACHED);
+            started = pthread_create(&thread, &attr, serveClient, reinterpret_cast<void*>(static_cast<intptr_t>(fd))) == 0;
+            pthread_attr_destroy(&attr);
         }
+        if (started)
+            ++g_clients;
+        else
+            ::close(fd); // too many at once: this client hears no reply
     }
     return nullptr;
 }
@@ -358,8 +429,15 @@ int runControl(const std::vector<std::string>& words, std::string* out)
             *out += componentMif(c);
             return 0;
         }
-        if (cmd == "uninstall")
-            return statusResult(uninstall(c) ? StatusOk : StatusNotFound, out);
+        if (cmd == "uninstall") {
+            std::string error;
+            uint32_t status = uninstall(c, &error);
+            if (status == StatusStorageFailed && !error.empty()) {
+                *out += "cannot remove component " + std::to_string(c) + ": " + error + "\n";
+                return 1;
+            }
+            return statusResult(status, out);
+        }
         return statusResult(raiseInstallEvent(c, cmd == "install-event"), out);
     }
     if (cmd == "attributes" || cmd == "rows") {
@@ -460,6 +538,7 @@ int runControl(const std::vector<std::string>& words, std::string* out)
         *out += "registrations\t" + std::to_string(registrations()) + "\n";
         *out += "indications delivered\t" + std::to_string(indicationsDelivered()) + "\n";
         *out += "indications outstanding\t" + std::to_string(indicationsOutstanding()) + "\n";
+        *out += "storage operations\t" + std::to_string(storageOperationCount()) + "\n";
         for (const std::string& e : loadErrors())
             *out += "load error\t" + e + "\n";
         return 0;
@@ -509,14 +588,19 @@ bool startControl(const std::string& path, std::string* error)
 
 void stopControl()
 {
-    std::lock_guard<std::mutex> lock(g_controlMu);
+    std::unique_lock<std::mutex> lock(g_controlMu);
     if (g_listenFd < 0)
         return;
     char b = 1;
     if (::write(g_stopPipe[1], &b, 1) != 1) {
         // The pipe is empty and ours: a write cannot fail but for EINTR.
     }
+    // The listening thread takes the lock to count a new client.
+    lock.unlock();
     pthread_join(g_thread, nullptr);
+    lock.lock();
+    // The serving threads see the stop pipe too and end at once.
+    g_clientsDone.wait(lock, [] { return g_clients == 0; });
     ::close(g_listenFd);
     ::close(g_stopPipe[0]);
     ::close(g_stopPipe[1]);
@@ -536,22 +620,36 @@ int controlRequest(const std::string& socketPath, const std::vector<std::string>
     struct sockaddr_un addr;
     if (!fillAddress(socketPath, &addr))
         return -1;
-    int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
     if (fd < 0)
         return -1;
-    if (::connect(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr) != 0) {
+    Wire wire{fd, Clock::now() + std::chrono::milliseconds(ClientDeadlineMs)};
+    // A full listen queue refuses a non-blocking connect for now: try again.
+    int rc;
+    while ((rc = ::connect(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr)) != 0 &&
+           (errno == EAGAIN || errno == EINTR) && Clock::now() < wire.deadline)
+        ::usleep(10000);
+    if (rc != 0) {
+        int error = errno;
         ::close(fd);
-        return -1;
+        if (error == ENOENT || error == ECONNREFUSED)
+            return -1; // nobody listens
+        errno = error;
+        *out += pathError(socketPath) + "\n";
+        return 3;
     }
-    bool ok = writeWord(fd, static_cast<uint32_t>(args.size()));
+    bool ok = wire.writeWord(static_cast<uint32_t>(args.size()));
     for (size_t i = 0; ok && i < args.size(); ++i)
-        ok = writeText(fd, args[i]);
+        ok = wire.writeText(args[i]);
     uint32_t code = 0;
     std::string reply;
-    ok = ok && readWord(fd, &code) && readText(fd, &reply);
+    ok = ok && wire.readWord(&code) && wire.readText(&reply);
     ::close(fd);
     if (!ok) {
-        *out += "no reply from the provider at " + socketPath + "\n";
+        *out += Clock::now() >= wire.deadline
+                    ? "the provider at " + socketPath + " did not answer within " +
+                          std::to_string(ClientDeadlineMs / 1000) + " seconds\n"
+                    : "no reply from the provider at " + socketPath + "\n";
         return 3;
     }
     *out += reply;

@@ -4,10 +4,16 @@
 // The provider keeps installed components in a database directory, one MIF
 // text file per component ("component-<id>.mif") holding its current values.
 // The directory is taken from the environment variable DMISP_DB, default
-// /var/lib/dmisp. It starts lazily: on the first DmiInvoke or the first call
-// of this interface that needs the database. While it is open it holds an
-// exclusive flock on the directory and serves the control socket (env
-// DMISP_SOCKET, default "<database>/control.sock").
+// /var/lib/dmisp; it must belong to this process's user and be writable by
+// nobody else (it is created 0700). The provider starts lazily: on the first
+// DmiInvoke or the first call of this interface that needs the database.
+//
+// One process at a time holds the database (an exclusive lock on the file
+// "lock" in it): the process that registered for indications (the daemon),
+// which also serves the control socket (env DMISP_SOCKET, default
+// "<database>/control.sock"), or one that opened it through this interface.
+// Any other process forwards its commands to the holder over that socket, or,
+// when none serves it, takes the database only while it has commands.
 //
 // Management-interface entry point (C linkage, exported):
 //   uint32_t DmiInvoke(void* commandBlock);
@@ -72,8 +78,9 @@ std::vector<std::string> loadErrors();
 uint32_t install(const std::string& mifPath, std::string* error = nullptr);
 // The same for MIF text; `name` is used in error texts.
 uint32_t installText(const std::string& text, const std::string& name, std::string* error = nullptr);
-// Removes a component: true when it existed.
-bool uninstall(uint32_t component);
+// Removes a component and its file: a Status (StatusNotFound when it does not
+// exist, StatusStorageFailed with *error when its file cannot be removed).
+uint32_t uninstall(uint32_t component, std::string* error = nullptr);
 
 struct ComponentInfo {
     uint32_t id;

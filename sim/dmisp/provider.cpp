@@ -11,6 +11,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <deque>
+#include <fcntl.h>
 #include <map>
 #include <memory>
 #include <mutex>
@@ -33,6 +34,19 @@ typedef void (*IndicationFunction)(void* indication);
 
 constexpr const char* DefaultDatabase = "/var/lib/dmisp";
 constexpr unsigned LockWaitMs = 2000;
+// A process registering for indications waits this long for a command-line
+// process to let the database go.
+constexpr unsigned DaemonLockWaitMs = 5000;
+// A command-line process lets the database go after this long without a command.
+constexpr auto IdleRelease = std::chrono::milliseconds(100);
+
+// How this process holds the database while it is open.
+//  - Explicit: opened through reset() or the C++ interface; held until shutdown().
+//  - Daemon: a registration with an indication callback; held until shutdown().
+//  - Transient: opened by a command of a process that receives no indications
+//    (a command-line mode); let go when idle and taken again by the next
+//    command, so such a process never keeps it longer than its commands need.
+enum class Hold { Explicit, Daemon, Transient };
 
 struct Registration {
     uint32_t handle;
@@ -51,7 +65,11 @@ struct State {
     std::condition_variable wake; // work for the worker or the indication thread
     std::condition_variable idle; // a queue ran empty
     Database db;
-    bool open = false;
+    bool open = false; // the provider's threads run (holding or forwarding)
+    std::atomic<Hold> hold{Hold::Explicit}; // written under g_lifecycle and mu
+    std::string directory; // the database directory in use
+    unsigned users = 0;    // component-interface commands in progress
+    std::chrono::steady_clock::time_point lastUse;
     // Not empty: another process's provider holds the database and this one
     // forwards its commands to that provider's control socket.
     std::string forwardSocket;
@@ -166,7 +184,28 @@ Outcome managementCommand(State& s, const Command& c)
 
 bool readText(const std::string& path, std::string* text, std::string* error);
 uint32_t installParsed(State& s, Component c, std::string* error);
-bool uninstallLocked(State& s, uint32_t id);
+uint32_t uninstallLocked(State& s, uint32_t id, std::string* error);
+
+// A listing, attribute or row command on the database this process holds. A
+// set is written to the component's file before the confirm; when that write
+// fails the change is undone in memory too, so memory never differs from disk.
+Outcome storedCommand(State& s, const uint8_t* block)
+{
+    Component before;
+    if (loadWordAt(block, 1) == 769)
+        if (const Component* c = s.db.find(loadWordAt(block, 16)))
+            before = *c;
+    uint32_t persist = 0;
+    Outcome o = executeCommand(s.db, block, &persist);
+    std::string error;
+    if (persist != 0 && !s.db.persist(persist, &error)) {
+        *s.db.find(persist) = std::move(before);
+        std::fprintf(stderr, "dmisp: cannot write %s\n", error.c_str());
+        o = Outcome();
+        o.status = StatusStorageFailed;
+    }
+    return o;
+}
 
 // A database command (listing, attribute, row, component interface) on the
 // database this process holds; `lock` holds s.mu and is released while an
@@ -175,7 +214,6 @@ Outcome databaseCommand(State& s, std::unique_lock<std::mutex>& lock, uint8_t* b
 {
     Outcome o;
     uint32_t code = loadWordAt(block, 1);
-    uint32_t persist = 0;
     if (loadWordAt(block, 0) != LevelCheck) {
         o.status = StatusMalformed;
     } else if (code == 1026) {
@@ -200,12 +238,13 @@ Outcome databaseCommand(State& s, std::unique_lock<std::mutex>& lock, uint8_t* b
             }
         }
     } else if (code == 1027) {
-        o.status = uninstallLocked(s, loadWordAt(block, 16)) ? StatusOk : StatusNotFound;
+        std::string error;
+        o.status = uninstallLocked(s, loadWordAt(block, 16), &error);
+        if (o.status == StatusStorageFailed)
+            std::fprintf(stderr, "dmisp: uninstall refused: %s\n", error.c_str());
     } else {
-        o = executeCommand(s.db, block, &persist);
+        o = storedCommand(s, block);
     }
-    if (persist != 0 && !s.db.persist(persist))
-        o.status = StatusStorageFailed;
     return o;
 }
 
@@ -249,8 +288,17 @@ void* workerThread(void*)
 {
     State& s = st();
     std::unique_lock<std::mutex> lock(s.mu);
+    auto ready = [&] { return s.stopping || !s.commands.empty(); };
     for (;;) {
-        s.wake.wait(lock, [&] { return s.stopping || !s.commands.empty(); });
+        if (s.hold == Hold::Transient) {
+            if (!s.wake.wait_for(lock, IdleRelease, ready)) {
+                if (s.db.isOpen() && s.users == 0 && std::chrono::steady_clock::now() - s.lastUse >= IdleRelease)
+                    s.db.close(); // the next command takes it again
+                continue;
+            }
+        } else {
+            s.wake.wait(lock, ready);
+        }
         if (s.stopping)
             break;
         std::unique_ptr<Command> c = std::move(s.commands.front());
@@ -273,10 +321,7 @@ void* workerThread(void*)
             o = forwardCommand(socketPath, c->copy);
             lock.lock();
         } else {
-            uint32_t persist = 0;
-            o = executeCommand(s.db, c->copy, &persist);
-            if (persist != 0 && !s.db.persist(persist))
-                o.status = StatusStorageFailed;
+            o = storedCommand(s, c->copy);
         }
         if (o.status == StatusOk && code >= 512 && code <= 514 && s.listing512 > 0) {
             --s.listing512;
@@ -286,6 +331,7 @@ void* workerThread(void*)
         deliverOutcome(c->block, o);
         c->confirm(c->block);
         lock.lock();
+        s.lastUse = std::chrono::steady_clock::now();
         s.working = false;
         s.idle.notify_all();
     }
@@ -350,6 +396,7 @@ void closeLocked()
     s.registrations.clear();
     s.db.close();
     s.forwardSocket.clear();
+    s.directory.clear();
     s.open = false;
     s.stopping = false;
     s.working = s.delivering = false;
@@ -368,20 +415,56 @@ std::string controlPathFor(const std::string& directory)
     return (env != nullptr && *env != '\0') ? env : directory + "/control.sock";
 }
 
-// Opens the database, or with forwardTo set serves this process by
-// forwarding to the provider listening there (the database stays closed).
-bool openLocked(const std::string& directory, bool serveControl, std::string* error,
-                unsigned lockWaitMs = LockWaitMs, const std::string& forwardTo = "")
+std::string databaseFromEnvironment()
+{
+    const char* env = std::getenv("DMISP_DB");
+    return (env != nullptr && *env != '\0') ? env : DefaultDatabase;
+}
+
+// Whether a provider answers on the control socket of `directory`.
+bool providerAnswers(const std::string& directory)
+{
+    std::string out;
+    return controlRequest(controlPathFor(directory), {"status"}, &out) == 0;
+}
+
+// Takes the database for this process, or, with `forward`, serves it by
+// forwarding to the provider that holds it when that one answers on its
+// control socket. The database is waited for up to `lockWaitMs`. Under s.mu.
+bool acquireLocked(State& s, bool forward, unsigned lockWaitMs, std::string* error)
+{
+    std::string why;
+    for (unsigned wait : {0u, lockWaitMs}) {
+        if (s.db.open(s.directory, wait, &why))
+            return true;
+        if (forward && why.find("locked by another provider") != std::string::npos && providerAnswers(s.directory)) {
+            s.forwardSocket = controlPathFor(s.directory);
+            return true;
+        }
+    }
+    if (error != nullptr)
+        *error = why;
+    return false;
+}
+
+// Starts the provider on `directory` (closing what was open): the threads,
+// the database taken as `hold` says, and the control socket when serveControl.
+bool openLocked(const std::string& directory, Hold hold, bool serveControl, unsigned lockWaitMs, std::string* error)
 {
     State& s = st();
     closeLocked();
     {
         std::lock_guard<std::mutex> lock(s.mu);
-        if (!forwardTo.empty())
-            s.forwardSocket = forwardTo;
-        else if (!s.db.open(directory, lockWaitMs, error))
+        s.directory = directory;
+        s.hold = hold;
+        // Only a command-line process forwards: the process registered for
+        // indications must hold the database itself, or it would never see one.
+        if (!acquireLocked(s, hold == Hold::Transient, lockWaitMs, error)) {
+            s.directory.clear();
             return false;
+        }
         s.open = true;
+        s.lastUse = std::chrono::steady_clock::now();
         if (pthread_create(&s.worker, nullptr, workerThread, nullptr) != 0) {
             s.db.close();
             s.forwardSocket.clear();
@@ -407,7 +490,7 @@ bool openLocked(const std::string& directory, bool serveControl, std::string* er
         s.threads = true;
     }
     g_open = true;
-    if (serveControl && forwardTo.empty()) {
+    if (serveControl && s.forwardSocket.empty()) {
         std::string path = controlPathFor(directory);
         std::string controlError;
         if (!startControl(path, &controlError))
@@ -416,32 +499,67 @@ bool openLocked(const std::string& directory, bool serveControl, std::string* er
     return true;
 }
 
-// Opens the database named by DMISP_DB on first use.
-bool ensureOpen()
+// Opens the database named by DMISP_DB on first use: for the C++ interface
+// it is held until shutdown(); for a command of a process that receives no
+// indications (`transient`) only while that process has commands.
+bool ensureOpen(bool transient = false)
 {
-    if (g_open)
+    State& s = st();
+    if (g_open && (transient || s.hold != Hold::Transient))
         return true;
-    std::lock_guard<std::mutex> lock(g_lifecycle);
-    if (st().open)
-        return true;
-    const char* env = std::getenv("DMISP_DB");
-    const std::string directory = (env != nullptr && *env != '\0') ? env : DefaultDatabase;
-    std::string error;
-    // Another process's provider holds the database: when it answers on its
-    // control socket, forward to it; one that is still starting or going away
-    // gets the lock's usual wait first.
-    const std::string control = controlPathFor(directory);
-    auto answers = [&] {
-        std::string out;
-        return controlRequest(control, {"status"}, &out) == 0;
-    };
-    for (unsigned wait : {0u, LockWaitMs}) {
-        if (openLocked(directory, true, &error, wait))
+    std::lock_guard<std::mutex> life(g_lifecycle);
+    if (s.open) {
+        std::lock_guard<std::mutex> lock(s.mu);
+        if (transient || s.hold != Hold::Transient || !s.forwardSocket.empty())
             return true;
-        if (error.find("locked by another provider") != std::string::npos && answers() &&
-            openLocked(directory, false, &error, 0, control))
+        // The C++ interface works on a database of its own: keep it from now on.
+        std::string error;
+        if (!s.db.isOpen() && !s.db.open(s.directory, LockWaitMs, &error)) {
+            std::fprintf(stderr, "dmisp: %s\n", error.c_str());
+            return false;
+        }
+        s.hold = Hold::Explicit;
+        return true;
+    }
+    std::string error;
+    if (openLocked(databaseFromEnvironment(), transient ? Hold::Transient : Hold::Explicit, !transient, LockWaitMs,
+                   &error))
+        return true;
+    std::fprintf(stderr, "dmisp: %s\n", error.c_str());
+    return false;
+}
+
+// A registration with an indication callback: this process must hold the
+// database and serve the control socket. A command-line process that holds it
+// is waited for; after that (another daemon holds it) the registration is refused.
+bool holdForDaemon()
+{
+    State& s = st();
+    std::lock_guard<std::mutex> life(g_lifecycle);
+    if (s.open) {
+        std::lock_guard<std::mutex> lock(s.mu);
+        if (s.hold != Hold::Transient && s.db.isOpen())
             return true;
     }
+    // Forwarding, or holding only now and then: start again as the holder.
+    // (A command of this process still waiting for its confirm would wait in
+    // vain; a process registers for indications before it sends any.)
+    std::string directory = s.open ? s.directory : databaseFromEnvironment(), error;
+    if (openLocked(directory, Hold::Daemon, true, DaemonLockWaitMs, &error))
+        return true;
+    std::fprintf(stderr, "dmisp: %s\n", error.c_str());
+    return false;
+}
+
+// A command-line process whose hold was let go takes the database again (or
+// forwards, when a provider now serves it). Under s.mu.
+bool reacquireLocked(State& s)
+{
+    if (s.db.isOpen() || !s.forwardSocket.empty())
+        return true;
+    std::string error;
+    if (acquireLocked(s, true, LockWaitMs, &error))
+        return true;
     std::fprintf(stderr, "dmisp: %s\n", error.c_str());
     return false;
 }
@@ -462,35 +580,26 @@ uint32_t installParsed(State& s, Component c, std::string* error)
     return id;
 }
 
-bool uninstallLocked(State& s, uint32_t id)
+// A Status: StatusStorageFailed with *error when the file cannot be removed.
+uint32_t uninstallLocked(State& s, uint32_t id, std::string* error)
 {
     const Component* c = s.db.find(id);
     if (c == nullptr)
-        return false;
+        return StatusNotFound;
     std::vector<uint8_t> ind = componentIndication(*c, 3, s.levelCheck, completionWord());
-    s.db.uninstall(id);
+    if (!s.db.uninstall(id, error))
+        return StatusStorageFailed;
     queueIndication(s, std::move(ind));
-    return true;
+    return StatusOk;
 }
 
 bool readText(const std::string& path, std::string* text, std::string* error)
 {
-    FILE* f = std::fopen(path.c_str(), "rb");
-    if (f == nullptr) {
-        if (error != nullptr)
-            *error = path + ": " + std::strerror(errno);
-        return false;
-    }
-    text->clear();
-    char buf[65536];
-    size_t n;
-    while ((n = std::fread(buf, 1, sizeof buf, f)) > 0)
-        text->append(buf, n);
-    bool ok = !std::ferror(f);
-    std::fclose(f);
-    if (!ok && error != nullptr)
-        *error = path + ": read error";
-    return ok;
+    if (readRegularFile(AT_FDCWD, path.c_str(), true, text))
+        return true;
+    if (error != nullptr)
+        *error = pathError(path);
+    return false;
 }
 
 // The row of `g` named by key texts, or -1 with a Status.
@@ -589,7 +698,7 @@ std::string invokeForwarded(const std::string& command)
 int reset(const std::string& directory, bool serveControl, std::string* error)
 {
     std::lock_guard<std::mutex> lock(g_lifecycle);
-    return openLocked(directory, serveControl, error) ? 0 : -1;
+    return openLocked(directory, Hold::Explicit, serveControl, LockWaitMs, error) ? 0 : -1;
 }
 
 void shutdown()
@@ -632,12 +741,16 @@ uint32_t install(const std::string& mifPath, std::string* error)
     return installText(text, mifPath, error);
 }
 
-bool uninstall(uint32_t component)
+uint32_t uninstall(uint32_t component, std::string* error)
 {
+    std::string why;
     if (!ensureOpen())
-        return false;
+        return StatusStorageFailed;
     std::lock_guard<std::mutex> lock(st().mu);
-    return uninstallLocked(st(), component);
+    uint32_t status = uninstallLocked(st(), component, &why);
+    if (error != nullptr)
+        *error = why;
+    return status;
 }
 
 std::vector<ComponentInfo> components()
@@ -754,7 +867,9 @@ uint32_t setValue(uint32_t component, uint32_t group, uint32_t attribute, const 
         g->reindex();
         return StatusBadValue;
     }
-    if (!s.db.persist(component)) {
+    std::string error;
+    if (!s.db.persist(component, &error)) {
+        std::fprintf(stderr, "dmisp: cannot write %s\n", error.c_str());
         current = old;
         a.value = oldTemplate;
         g->reindex();
@@ -904,12 +1019,20 @@ using namespace dmisp;
 
 extern "C" __attribute__((visibility("default"))) uint32_t DmiInvoke(void* commandBlock)
 {
-    if (commandBlock == nullptr || !ensureOpen())
+    if (commandBlock == nullptr)
         return InvokeRefused;
     uint8_t* block = static_cast<uint8_t*>(commandBlock);
+    uint32_t code = loadWordAt(block, 1);
+    // A registration naming an indication callback makes this process the
+    // one that holds the database.
+    bool daemon = code == 256 && loadWordAt(block, 17) != 0;
+    if (!(daemon ? holdForDaemon() : ensureOpen(true)))
+        return InvokeRefused;
     State& s = st();
     std::unique_lock<std::mutex> lock(s.mu);
-    uint32_t code = loadWordAt(block, 1);
+    if (!reacquireLocked(s))
+        return InvokeRefused;
+    s.lastUse = std::chrono::steady_clock::now();
     ++s.received;
     ++s.receivedByCode[code];
     if (s.busy > 0) {
@@ -928,7 +1051,10 @@ extern "C" __attribute__((visibility("default"))) uint32_t DmiInvoke(void* comma
             lock.unlock();
             o = forwardCommand(socketPath, block);
         } else {
+            ++s.users; // the database is read without the lock: keep holding it
             o = databaseCommand(s, lock, block);
+            --s.users;
+            s.lastUse = std::chrono::steady_clock::now();
         }
         deliverOutcome(block, o);
         return InvokeAccepted;

@@ -326,7 +326,9 @@ int SLDmiRegisterMgmt(SLHandle* h, SLIndicationHandler handler)
         return 1;
     word(h, 1, cmdRegisterMgmt);
     word(h, 16, pointerWord(reinterpret_cast<void*>(&dmiConfirmFunc)));
-    word(h, 17, pointerWord(reinterpret_cast<void*>(&SLIndicationFunc)));
+    // A process without a handler asks for no indications: it names no
+    // indication callback, so the provider knows it serves no events.
+    word(h, 17, handler != nullptr ? pointerWord(reinterpret_cast<void*>(&SLIndicationFunc)) : 0);
     // In place before the provider can deliver the first indication.
     SLEventSetHandler(handler);
     if (SLSynchronousExecute(h) != 0) {

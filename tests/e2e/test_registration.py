@@ -57,7 +57,7 @@ class RegistrationTest(BedTestCase):
             # The provider refuses every command while another provider
             # holds its database: registration fails with 2.
             bed = self.bed("refused")
-            lock = os.open(bed.paths["db"], os.O_RDONLY | os.O_DIRECTORY)
+            lock = os.open(os.path.join(bed.paths["db"], "lock"), os.O_RDWR | os.O_CREAT, 0o600)
             self.addCleanup(os.close, lock)
             fcntl.flock(lock, fcntl.LOCK_EX)
             self.failure(bed, 2)
