@@ -99,7 +99,8 @@ int daemon_init(void)
     if (chdir("/") != 0) {
         // The root directory always exists; nothing sensible to do otherwise.
     }
-    umask(0);
+    // Files the detached process creates are never writable by group or others.
+    umask(022);
     for (int fd = 0; fd < maxOpenFileHandles(); ++fd)
         close(fd);
     return 0;

@@ -6,6 +6,7 @@
 #include <string>
 #include <syslog.h>
 
+#include "base/files.h"
 #include "base/log.h"
 #include "sl/sl.h"
 #include "sl/slaccess.h"
@@ -165,36 +166,123 @@ std::string mifPath(const char* file)
 
 bool mifReadable(const char* file)
 {
-    FILE* f = fopen(mifPath(file).c_str(), "r");
+    FILE* f = moxOpenRegular(mifPath(file).c_str());
     if (f == nullptr)
         return false;
     fclose(f);
     return true;
 }
 
-// Replaces the installed own MIF with the new one, carrying the old actions
-// table's integer settings over into the new MIF.
-void carryOver(SLHandle* h, float installedVersion)
+template <typename Visit> void walkComponents(SLHandle* h, const char* filter, Visit visit);
+
+// The ids of the installed own components in list order; at most `max`.
+int ownComponents(SLHandle* h, uint32_t* ids, int max)
+{
+    int n = 0;
+    walkComponents(h, nullptr, [&](uint32_t id) {
+        if (n < max && IsExactMatch(SLComponentName(h), moxComponentName) == 1)
+            ids[n++] = id;
+    });
+    return n;
+}
+
+// After a set that failed: whether the new table has the value's row and
+// attribute without holding the value (the write failed), rather than not
+// having them at all (the new MIF dropped them, and the value goes with them).
+bool valueMissing(SLHandle* h, uint32_t component, uint32_t group, uint32_t attribute, SLKeyList* keys,
+                  int32_t value)
+{
+    return SLGetAttribute(h, component, group, attribute, keys) == 0 && SLIntegerValue(h) != value;
+}
+
+// Writes the saved rows into table `moxActionTableGroup` of `component`.
+// 0 when every value the new table has a place for holds its saved value.
+int writeActionsTable(SLHandle* h, uint32_t component, ActionRow* first)
+{
+    uint32_t group = static_cast<uint32_t>(moxActionTableGroup);
+    for (ActionRow* row = first; row != nullptr; row = row->next) {
+        // A set without keys would address the table's first row.
+        if (row->keyList == nullptr)
+            continue;
+        uint32_t errorState = 0;
+        if (group != 10 && ModifyKeyList(row->keyList, &errorState) != 0)
+            continue;
+        bool written = true;
+        for (int i = 0; written && i < row->count; ++i) {
+            uint32_t attribute = row->pairs[i].attributeId;
+            if (attribute <= 6) {
+                // In group 3 attribute 6 is the enable flag, attribute 30 now.
+                if (moxNewKeyFormat != 0 || attribute != 6)
+                    continue;
+                attribute = 30;
+            }
+            int32_t value = row->pairs[i].value;
+            written = SLSetAttribute(h, component, group, attribute, row->keyList, sizeof value, &value) == 0 ||
+                      !valueMissing(h, component, group, attribute, row->keyList, value);
+        }
+        if (group != 10)
+            UnModifyKeyList(row->keyList);
+        if (!written)
+            return 1;
+    }
+    return 0;
+}
+
+// Replaces the installed own MIF `old`, of an older version, with the new one,
+// carrying the old actions table's integer settings over.
+//
+// The old MIF is removed last, once the new one holds every carried value, so
+// a crash or a failed write at any step leaves the old MIF first in list
+// order with all the administrator's settings; the next start then finds it
+// older again, removes the current copies behind it (a carry-over that did
+// not finish) and carries over once more. Until then the daemon runs on the
+// old MIF. Nothing here is kept between starts.
+void carryOver(SLHandle* h, uint32_t old, float installedVersion)
 {
     CarryOverBand band;
     if (!moxCarryOverBand(installedVersion, &band))
         return;
-    // Without the new file the reinstall would fail after the uninstall and
-    // leave no own MIF at all: keep the old one as it is.
+    // Without the new file the reinstall would fail: keep the old one as it is.
     if (!mifReadable(moxMifFile))
         return;
-    moxNewKeyFormat = band.keyFormat;
-    moxActionTableGroup = band.groupRead;
+    const int max = 16;
+    uint32_t before[max];
+    int count = ownComponents(h, before, max);
+    bool ok = count > 0 && before[0] == old;
+    for (int i = 1; ok && i < count; ++i) {
+        float version = 0;
+        CarryOverBand older;
+        if (SLGetComponentMIFVersion(h, before[i], &version) == 0 && !moxCarryOverBand(version, &older))
+            ok = SLCiUninstallData(h, before[i]) == 0;
+    }
+    if (!ok) {
+        moxLog(LOG_ERR, "%s\n", "MOX - could not remove an unfinished copy of mox.mif; the installed one is kept");
+        return;
+    }
     ActionRow* saved = GetNewActionRow();
     if (saved == nullptr)
-        return;
+        return; // out of memory: the next start tries again
+    moxNewKeyFormat = band.keyFormat;
+    moxActionTableGroup = band.groupRead;
     ReadMOXActionsTable(h, saved);
     moxActionTableGroup = band.groupWritten;
-    if (SLCiUninstallData(h, SLMapComponentNameToId(moxComponentName)) == 0) {
-        SLInstallMIF(h, moxMifFile);
-        WriteMOXActionsTable(h, saved);
+    uint32_t added = 0;
+    if (SLInstallMIF(h, moxMifFile) == 0) {
+        uint32_t after[max];
+        int n = ownComponents(h, after, max);
+        // The new component is the last listed: ids grow.
+        if (n > 0 && after[n - 1] != old)
+            added = after[n - 1];
     }
+    ok = added != 0 && writeActionsTable(h, added, saved) == 0 && SLCiUninstallData(h, old) == 0;
     DeleteActionTable(saved);
+    if (ok)
+        return;
+    if (added != 0)
+        SLCiUninstallData(h, added);
+    moxLog(LOG_ERR, "%s\n",
+           "MOX - could not carry the actions table over to the new mox.mif; the installed one is kept "
+           "and the carry-over is tried again at the next start");
 }
 
 // Walks the components the provider lists for `filter`, calling `visit` for
@@ -416,7 +504,7 @@ int findMOXmif(SLHandle* h)
     } else {
         float version = 0;
         if (SLGetInstalledMIFVersion(h, moxComponentName, &version) == 0)
-            carryOver(h, version);
+            carryOver(h, own, version);
     }
     own = SLMapComponentNameToId(moxComponentName);
     if (own == 0)
@@ -589,32 +677,12 @@ int WriteMOXActionsTable(SLHandle* h, ActionRow* first)
 {
     if (first == nullptr || h == nullptr)
         return 1;
-    uint32_t own = SLMapComponentNameToId(moxComponentName);
-    if (own == 0)
+    // The newest own component: the one a carry-over installed last.
+    uint32_t ids[16];
+    int n = ownComponents(h, ids, 16);
+    if (n == 0)
         return 1;
-    uint32_t group = static_cast<uint32_t>(moxActionTableGroup);
-    for (ActionRow* row = first; row != nullptr; row = row->next) {
-        // A set without keys would address the table's first row.
-        if (row->keyList == nullptr)
-            continue;
-        uint32_t errorState = 0;
-        if (group != 10 && ModifyKeyList(row->keyList, &errorState) != 0)
-            continue;
-        for (int i = 0; i < row->count; ++i) {
-            uint32_t attribute = row->pairs[i].attributeId;
-            if (attribute <= 6) {
-                // In group 3 attribute 6 is the enable flag, attribute 30 now.
-                if (moxNewKeyFormat != 0 || attribute != 6)
-                    continue;
-                attribute = 30;
-            }
-            int32_t value = row->pairs[i].value;
-            SLSetAttribute(h, own, group, attribute, row->keyList, sizeof value, &value);
-        }
-        if (group != 10)
-            UnModifyKeyList(row->keyList);
-    }
-    return 0;
+    return writeActionsTable(h, ids[n - 1], first);
 }
 
 int DeleteActionTable(ActionRow* first)

@@ -181,7 +181,13 @@ int SLGetInstalledMIFVersion(SLHandle* h, const char* name, float* version)
 {
     if (h == nullptr || name == nullptr)
         return 1;
-    uint32_t c = SLMapComponentNameToId(name);
+    return SLGetComponentMIFVersion(h, SLMapComponentNameToId(name), version);
+}
+
+int SLGetComponentMIFVersion(SLHandle* h, uint32_t c, float* version)
+{
+    if (h == nullptr)
+        return 1;
     uint32_t g = SLMapClassNameToId(c, componentIdClass);
     uint32_t a = SLMapAttributeNameToId(c, g, versionAttribute);
     if (c == 0 || g == 0 || a == 0)

@@ -18,4 +18,6 @@ int PrefixMatches(const DmiString* d, const char* s);
 // Installs `file` from the MIF directory ("UXDMIPATH", else "/var/dmi/mifs/backup").
 int SLInstallMIF(SLHandle* h, const char* file);
 int SLGetInstalledMIFVersion(SLHandle* h, const char* name, float* version);
+// The same for the component with id `component` (0: none).
+int SLGetComponentMIFVersion(SLHandle* h, uint32_t component, float* version);
 }
