@@ -272,6 +272,7 @@ find '%s' -mindepth 1 -delete; exit 0
         if probe.returncode != 0:
             raise unittest.SkipTest("cannot create namespaces: %s" % probe.stderr.decode().strip())
         init_stub = require("MOX_INIT_STUB", "the /sbin/init stub")
+        self._preload()  # made now, before processes start from several threads
         self.log = SyslogReceiver(self.paths["log"])
         binds = [[self.paths["log"], "/dev/log"], [self.paths["cfg"], "/usr/local/ubo/bin"],
                  [self.paths["run"], "/var/run"], [self.paths["floppy"], "/mnt/floppy"], [init_stub, "/sbin/init"]]

@@ -193,33 +193,6 @@ TEST_F(Provider, CarryOverBandsFailuresAndKeylessRows)
             EXPECT_EQ(value(own(), 10, a, {"1", "50", "1", "0", "0", "4", "7", "8"}), r.standard[i]) << a;
         }
     }
-    // A refused install, first write or removal of the old MIF keeps the old
-    // one and its settings, says so, and leaves the carry-over to the next start.
-    static uint32_t refusedCode;
-    for (uint32_t code : {1026u, 769u, 1027u}) {
-        SCOPED_TRACE(code);
-        freshDatabase();
-        uint32_t old = install(oldOwnMif("2.40"));
-        refusedCode = code;
-        SLDmiInvoke = [](void* block) {
-            if (loadWordAt(block, 1) == refusedCode && dmisp::commandsReceived(refusedCode) == 0)
-                dmisp::injectRefuse(1);
-            return DmiInvoke(block);
-        };
-        EXPECT_EQ(RegisterWithSL(), 0);
-        SLDmiInvoke = DmiInvoke;
-        EXPECT_EQ(own(), old);
-        EXPECT_EQ(dmisp::components().size(), 1u);
-        Lines logged = lines();
-        ASSERT_FALSE(logged.empty());
-        EXPECT_EQ(logged.back(), Lines::value_type(LOG_ERR, "MOX - could not carry the actions table over to the new "
-                                                             "mox.mif; the installed one is kept and the carry-over "
-                                                             "is tried again at the next start\n"));
-        UnregisterWithSL();
-        ASSERT_EQ(RegisterWithSL(), 0);
-        EXPECT_EQ(dmisp::components().size(), 1u);
-        EXPECT_EQ(value(own(), 4, 30, {"1", "33", "3", "0", "-2147483648", "0"}), "0");
-    }
     // The current version, or no new file to read: nothing is uninstalled.
     for (const char* v : {"2.93", "2.60"}) {
         freshDatabase();
