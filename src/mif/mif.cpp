@@ -516,6 +516,11 @@ int catalogueInstalledMifs(SLHandle* h)
     return 0;
 }
 
+const char* MoxComponentName(void)
+{
+    return moxComponentName;
+}
+
 void UnregisterWithSL(void)
 {
     deleteComponentList(componentList);
