@@ -42,6 +42,11 @@ void say(Report& report, const char* level, const char* format, ...)
     report.errors += level[0] == 'e' ? 1 : 0;
 }
 
+const char* rowsAsk(unsigned count)
+{
+    return count == 1 ? "row asks" : "rows ask";
+}
+
 const char* onOff(uint32_t flag)
 {
     return flag != 0 ? "on" : "off";
@@ -108,9 +113,9 @@ void checkTables(SLHandle* h, Report& report, Tables& tables)
             group == 10 ? "standard" : "vendor", survey.rows, survey.enabled);
         if (survey.conflicting != 0)
             say(report, "warning",
-                "actions table group %d: %u enabled rows ask for more than one system-control action, of which "
-                "only the first in run order can happen (first: keys %s)",
-                group, survey.conflicting, survey.conflict);
+                "actions table group %d: %u enabled %s for more than one system-control action, of which only "
+                "the first in run order can happen (first: keys %s)",
+                group, survey.conflicting, rowsAsk(survey.conflicting), survey.conflict);
         tables.email += survey.email;
         tables.alarm += survey.alarm;
         tables.control += survey.control;
@@ -119,10 +124,11 @@ void checkTables(SLHandle* h, Report& report, Tables& tables)
     bool serverSet = emailServerSet(h, server, sizeof server);
     if (tables.email != 0 && !serverSet)
         say(report, "warning",
-            "%u enabled rows ask for e-mail but no SMTP server is set (baseboard group 1012, attribute 1)",
-            tables.email);
+            "%u enabled %s for e-mail but no SMTP server is set (baseboard group 1012, attribute 1)", tables.email,
+            rowsAsk(tables.email));
     else if (tables.email != 0)
-        say(report, "ok", "%u enabled rows ask for e-mail, sent through server %s", tables.email, server);
+        say(report, "ok", "%u enabled %s for e-mail, sent through server %s", tables.email, rowsAsk(tables.email),
+            server);
 }
 
 void checkFiles(Report& report, const Tables& tables)
@@ -144,13 +150,14 @@ void checkFiles(Report& report, const Tables& tables)
         say(report, "ok", "no marker file in the working directory %s (the floppy is not looked at)", directory);
 
     if (tables.control != 0 && bNotificationOnly != 0)
-        say(report, "ok", "%u enabled rows ask for system control, skipped under notificationonly", tables.control);
+        say(report, "ok", "%u enabled %s for system control, skipped under notificationonly", tables.control,
+            rowsAsk(tables.control));
     else if (tables.control != 0 && stat(obxDevicePath, &status) == 0 && S_ISCHR(status.st_mode))
-        say(report, "ok", "%s present for the %u enabled rows that ask for system control", obxDevicePath,
-            tables.control);
+        say(report, "ok", "%s present: %u enabled %s for system control", obxDevicePath, tables.control,
+            rowsAsk(tables.control));
     else if (tables.control != 0)
-        say(report, "error", "%u enabled rows ask for system control but %s is not present as a device",
-            tables.control, obxDevicePath);
+        say(report, "error", "%u enabled %s for system control but %s is not present as a device", tables.control,
+            rowsAsk(tables.control), obxDevicePath);
     else
         say(report, "ok", "no enabled row asks for system control");
 
@@ -167,11 +174,11 @@ void checkFiles(Report& report, const Tables& tables)
     else if (peer == KobPeer::Running)
         say(report, "error", "kobd runs (process %s) but %s is no FIFO: it gets no alarm record", pid, paths.fifo);
     else if (peer == KobPeer::None)
-        say(report, "warning", "%u enabled rows log events, but no alarm peer runs (no %s): no alarm record is sent",
-            tables.alarm, paths.lockFile);
+        say(report, "warning", "%u enabled %s for the alarm record, but no alarm peer runs (no %s)", tables.alarm,
+            rowsAsk(tables.alarm), paths.lockFile);
     else
-        say(report, "warning", "%u enabled rows log events, but %s names %s: no alarm record is sent", tables.alarm,
-            paths.lockFile, peer == KobPeer::Stale ? "no running kobd" : "a process that has ended");
+        say(report, "warning", "%u enabled %s for the alarm record, but %s names %s", tables.alarm,
+            rowsAsk(tables.alarm), paths.lockFile, peer == KobPeer::Stale ? "no running kobd" : "a process that has ended");
 }
 
 } // namespace

@@ -159,7 +159,7 @@ class AdminTest(EventBedCase):
             "ok the DMI service provider answers (DMI 1.1, Mox substitute DMI service provider)",
             "ok own MIF installed: component %d, version 2.93; a start carries nothing over" % ids["mox"],
             "ok actions table group 10 (standard events): 20 rows, 20 enabled",
-            "warning actions table group 10: 1 enabled rows ask for more than one system-control action, of which "
+            "warning actions table group 10: 1 enabled row asks for more than one system-control action, of which "
             "only the first in run order can happen (first: keys 1=1 2=20 3=2 4=0 5=0 6=0 31=2 32=2: powerOff, "
             "resetSystem)",
             "ok actions table group 4 (vendor events): 12 rows, 12 enabled",
@@ -174,7 +174,7 @@ class AdminTest(EventBedCase):
         self.assertEqual(done.returncode, 1, done.stdout)
         self.assertIn("error ./mox.not in the working directory %s disables the daemon\n" % bed.paths["work"],
                       done.stdout.decode())
-        self.assertIn("ok /dev/obx present for the 2 enabled rows that ask for system control\n", done.stdout.decode())
+        self.assertIn("ok /dev/obx present: 2 enabled rows ask for system control\n", done.stdout.decode())
         os.remove(os.path.join(bed.paths["work"], "mox.not"))
         self.assertEqual(check().returncode, 0)
         self.assertEqual((bed.log.since(start, tag=None), writes()), ([], before))

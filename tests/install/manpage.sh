@@ -23,7 +23,7 @@ for fact in /usr/local/ubo/bin/mox.cfg notificationonly /var/dmi/mifs/backup/mox
     /var/run/kobLock /dev/kob /dev/obx UXDMIPATH "group 1012" "Group 10" "Group 4" \
     "mox: initialization failed, return code = 0x" "Mox has been disabled." \
     "mount -t msdos /dev/fd0 /mnt/floppy" SIGTERM SIGINT SIGQUIT SIGPWR SIGHUP \
-    --version --help --test-email actionlog Type=notify READY=1 "journalctl -u mox" "dmictl(8)"; do
+    --version --help --test-email --check --explain actionlog Type=notify READY=1 "journalctl -u mox" "dmictl(8)"; do
     grep -qF -- "$fact" <<<"$text" || fail "does not mention $fact"
 done
 
