@@ -58,10 +58,12 @@ int systemControl(const Control& control, const EventRecord* record, const Expla
 {
     SystemControlInfo info;
     int rc = MoxGetSystemControlInfo(&info);
-    if (rc == 0 && (info.capabilities & control.capability) == 0)
-        explainLine(explain, "nothing: capability 0x%x is not offered", control.capability);
-    if (rc != 0 || (info.capabilities & control.capability) == 0)
+    if (rc != 0)
         return rc;
+    if ((info.capabilities & control.capability) == 0) {
+        explainLine(explain, "nothing: capability 0x%x is not offered", control.capability);
+        return 0;
+    }
     if (explain != nullptr) {
         if (bNotificationOnly != 0)
             explainLine(explain, "skipped: notificationonly is set");
@@ -361,7 +363,8 @@ struct ActionLines {
 void actionLine(void* context, const char* text)
 {
     auto* lines = static_cast<ActionLines*>(context);
-    explainLine(lines->outer, "action %u %s: %s", lines->entry->code, lines->entry->name, text);
+    const char* name = lines->entry->name != nullptr ? lines->entry->name : "(unnamed)";
+    explainLine(lines->outer, "action %u %s: %s", lines->entry->code, name, text);
 }
 
 } // namespace
