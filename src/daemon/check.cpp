@@ -53,9 +53,15 @@ const char* onOff(uint32_t flag)
 }
 
 // The own components installed, their versions and what a start would carry
-// over from each.
-void checkOwnMif(SLHandle* h, Report& report)
+// over from each; true when a start replaces an installed one.
+bool checkOwnMif(SLHandle* h, Report& report)
 {
+    char path[PATH_MAX];
+    FILE* file = slMifPath("mox.mif", path, sizeof path) ? moxOpenRegular(path) : nullptr;
+    bool fileReadable = file != nullptr;
+    if (file != nullptr)
+        fclose(file);
+    bool replaced = false;
     SLHandle* reader = SLCreateHandle(0);
     unsigned found = 0;
     uint32_t last = 0;
@@ -66,12 +72,18 @@ void checkOwnMif(SLHandle* h, Report& report)
         ++found;
         float version = 0;
         CarryOverBand band;
-        if (slInstalledMifVersionOf(reader, last, &version) != 0)
+        bool readable = slInstalledMifVersionOf(reader, last, &version) == 0;
+        bool migrates = readable && moxCarryOverBand(version, &band);
+        replaced |= migrates && fileReadable;
+        if (!readable)
             say(report, "warning", "own MIF component %u: its version cannot be read; a start carries nothing over",
                 last);
-        else if (!moxCarryOverBand(version, &band))
+        else if (!migrates)
             say(report, "ok", "own MIF installed: component %u, version %g; a start carries nothing over", last,
                 version);
+        else if (!fileReadable)
+            say(report, "warning", "own MIF installed: component %u, version %g; %s cannot be read, so a start "
+                "keeps it as it is", last, version, path);
         else
             say(report, "warning",
                 "own MIF installed: component %u, version %g; a start installs the new mox.mif and carries "
@@ -79,21 +91,14 @@ void checkOwnMif(SLHandle* h, Report& report)
                 last, version, band.groupRead, band.groupWritten);
     }
     SLDestroyHandle(reader);
-    char path[PATH_MAX];
-    bool readable = false;
-    if (slMifPath("mox.mif", path, sizeof path)) {
-        FILE* file = moxOpenRegular(path);
-        readable = file != nullptr;
-        if (file != nullptr)
-            fclose(file);
-    }
     if (found > 1)
         say(report, "warning", "%u own components installed: a carry-over was interrupted; a start completes it",
             found);
-    if (found == 0 && readable)
-        say(report, "warning", "own MIF not installed: a start installs %s with its default rows", path);
+    if (found == 0 && fileReadable)
+        say(report, "ok", "own MIF not installed yet: a start installs %s with its default rows", path);
     else if (found == 0)
         say(report, "error", "own MIF not installed and %s cannot be read: the daemon cannot start", path);
+    return replaced;
 }
 
 // What the enabled rows of both actions tables ask for, summed.
@@ -101,12 +106,13 @@ struct Tables {
     unsigned email = 0, alarm = 0, control = 0;
 };
 
-void checkTables(SLHandle* h, Report& report, Tables& tables)
+void checkTables(SLHandle* h, Report& report, Tables& tables, bool replaced)
 {
     for (int group : {10, 4}) {
         ActionsTableSurvey survey;
         if (!surveyActionsTable(h, group, &survey)) {
-            say(report, "error", "actions table group %d cannot be read", group);
+            say(report, replaced ? "warning" : "error", "actions table group %d cannot be read%s", group,
+                replaced ? " in the MIF a start replaces" : "");
             continue;
         }
         say(report, "ok", "actions table group %d (%s events): %u rows, %u enabled", group,
@@ -198,10 +204,10 @@ int moxCheck(FILE* out)
         implementation != nullptr ? implementation : "implementation unknown");
     SLDeleteString(level);
     SLDeleteString(implementation);
-    checkOwnMif(h, report);
+    bool replaced = checkOwnMif(h, report);
     Tables tables;
     if (catalogueInstalledMifs(h) == 0)
-        checkTables(h, report, tables);
+        checkTables(h, report, tables, replaced);
     checkFiles(report, tables);
     SLDmiUnregisterMgmt(h);
     SLDestroyHandle(h);
