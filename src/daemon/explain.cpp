@@ -137,16 +137,19 @@ bool readRow(SLHandle* h, uint32_t component, const RowArgument& argument, Event
     SLKeyList* keys = SLCreateKeyList(h); // the group's keys, without values
     uint32_t keyCount = keys != nullptr ? keys->count : 0;
     bool named = keyCount == argument.keyCount;
+    if (!named)
+        fprintf(err, "mox: group %u of component %u has %u key%s; give each with -k in key order\n", group,
+                component, keyCount, keyCount == 1 ? "" : "s");
     for (uint32_t i = 0; named && i < keyCount; ++i) {
         keys->keys[i].value = keyValue(h, component, group, keys->keys[i], argument.keys[i]);
         named = keys->keys[i].value != nullptr;
+        if (!named)
+            fprintf(err, "mox: %s is no value of key %u of group %u\n", argument.keys[i], keys->keys[i].attributeId,
+                    group);
     }
     event.rows[index] = named ? SLCreateHandle(0) : nullptr;
     bool found = event.rows[index] != nullptr && SLGetRow(event.rows[index], component, group, 0, keys) == 0;
-    if (!named)
-        fprintf(err, "mox: group %u of component %u has %u keys; give each with -k in key order\n", group,
-                component, keyCount);
-    else if (!found)
+    if (named && !found)
         fprintf(err, "mox: group %u of component %u has no row with these keys\n", group, component);
     SLDeleteKeyList(keys);
     return found;
