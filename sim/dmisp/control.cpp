@@ -535,6 +535,12 @@ int runControl(const std::vector<std::string>& words, std::string* out)
     if (cmd == "status") {
         *out += "database\t" + databaseDirectory() + "\n";
         *out += "commands\t" + std::to_string(commandsReceived()) + "\n";
+        // Commands that may change the database: set, reserve, release and the
+        // component-instrumentation commands (install, uninstall among them).
+        uint64_t writes = 0;
+        for (uint32_t code : {769u, 770u, 771u, 1024u, 1025u, 1026u, 1027u})
+            writes += commandsReceived(code);
+        *out += "writes\t" + std::to_string(writes) + "\n";
         *out += "registrations\t" + std::to_string(registrations()) + "\n";
         *out += "indications delivered\t" + std::to_string(indicationsDelivered()) + "\n";
         *out += "indications outstanding\t" + std::to_string(indicationsOutstanding()) + "\n";

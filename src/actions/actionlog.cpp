@@ -2,12 +2,15 @@
 
 #include <cstdio>
 #include <cstring>
+#include <initializer_list>
 #include <syslog.h>
 
+#include "actions/actions.h"
 #include "actions/uxaction.h"
 #include "base/log.h"
 #include "mif/format.h"
 #include "mif/mif.h"
+#include "sl/sl.h"
 #include "sl/slhandle.h"
 #include "sl/slkey.h"
 
@@ -18,8 +21,11 @@ namespace {
 constexpr uint32_t emailGroup = 1012;
 constexpr uint32_t emailSwitch = 20;
 constexpr uint32_t enableFlag = 30;
+constexpr uint32_t logSwitch = 9;
 
-const char* controlName(uint32_t code)
+} // namespace
+
+const char* systemControlName(uint32_t code)
 {
     switch (code) {
     case 1:
@@ -39,6 +45,8 @@ const char* controlName(uint32_t code)
     }
 }
 
+namespace {
+
 struct EmailOutcome {
     bool failed = false;
     SmtpStep step{};
@@ -56,36 +64,70 @@ void recordFailure(void* context, const SmtpStep& step)
     outcome->step.message = outcome->message;
 }
 
-// Enabled rows of one actions table of the own component that ask for e-mail.
-unsigned rowsAskingForEmail(SLHandle* h, int group)
+void surveyRow(const ActionRow& row, ActionsTableSurvey* survey)
 {
-    int savedGroup = moxActionTableGroup;
-    moxActionTableGroup = group;
-    ActionRow* first = GetNewActionRow();
-    if (first == nullptr) {
-        moxActionTableGroup = savedGroup;
-        return 0;
+    bool enabled = true;
+    uint32_t controls[6];
+    unsigned control = 0;
+    bool email = false, alarm = false;
+    for (int i = 0; i < row.count; ++i) {
+        uint32_t id = row.pairs[i].attributeId;
+        bool on = row.pairs[i].value != 0;
+        if (id == enableFlag)
+            enabled = on;
+        email |= id == emailSwitch && on;
+        alarm |= id == logSwitch && on;
+        if (on && isSystemControlAction(id) && control < 6)
+            controls[control++] = id;
     }
-    ReadMOXActionsTable(h, first);
-    moxActionTableGroup = savedGroup;
-    unsigned count = 0;
-    for (ActionRow* row = first; row != nullptr; row = row->next) {
-        bool enabled = true;
-        bool email = false;
-        for (int i = 0; i < row->count; ++i) {
-            if (row->pairs[i].attributeId == enableFlag)
-                enabled = row->pairs[i].value != 0;
-            if (row->pairs[i].attributeId == emailSwitch)
-                email = row->pairs[i].value != 0;
-        }
-        if (enabled && email)
-            ++count;
+    if (!enabled)
+        return;
+    ++survey->enabled;
+    survey->email += email ? 1 : 0;
+    survey->alarm += alarm ? 1 : 0;
+    survey->control += control != 0 ? 1 : 0;
+    if (control < 2)
+        return;
+    // Each of them ends the machine's or the daemon's run: only the first in
+    // run order can happen.
+    if (survey->conflicting++ != 0)
+        return;
+    explainKeys(row.keyList, survey->conflict, sizeof survey->conflict);
+    for (unsigned c = 0; c < control; ++c) {
+        size_t used = strlen(survey->conflict);
+        snprintf(survey->conflict + used, sizeof survey->conflict - used, "%s%s", c == 0 ? ": " : ", ",
+                 actionName(controls[c]));
     }
-    DeleteActionTable(first);
-    return count;
 }
 
 } // namespace
+
+bool surveyActionsTable(SLHandle* h, int group, ActionsTableSurvey* survey)
+{
+    *survey = ActionsTableSurvey{};
+    uint32_t own = MyComponentId();
+    if (own == 0 || SLListGroup(h, own, static_cast<uint32_t>(group)) != 0)
+        return false;
+    int savedGroup = moxActionTableGroup;
+    moxActionTableGroup = group;
+    ActionRow* first = GetNewActionRow();
+    if (first != nullptr)
+        ReadMOXActionsTable(h, first);
+    moxActionTableGroup = savedGroup;
+    // A first row that cannot be read leaves the first record without keys.
+    for (ActionRow* row = first; row != nullptr && row->keyList != nullptr; row = row->next) {
+        ++survey->rows;
+        surveyRow(*row, survey);
+    }
+    DeleteActionTable(first);
+    return true;
+}
+
+bool emailServerSet(SLHandle* h, char* server, size_t size)
+{
+    return getStringValue(h, BaseboardComponentId(), emailGroup, 1, nullptr, server, static_cast<int>(size)) != 0 &&
+           server[0] != '\0';
+}
 
 void actionLogEventName(const EventRecord* record, char* out, size_t size)
 {
@@ -105,9 +147,9 @@ void actionLogSystemControl(uint32_t controlCode, const EventRecord* record, boo
     char event[400];
     actionLogEventName(record, event, sizeof event);
     if (skipped)
-        moxLog(LOG_NOTICE, "mox action: %s skipped for %s: notifications only\n", controlName(controlCode), event);
+        moxLog(LOG_NOTICE, "mox action: %s skipped for %s: notifications only\n", systemControlName(controlCode), event);
     else
-        moxLog(LOG_NOTICE, "mox action: %s ordered for %s\n", controlName(controlCode), event);
+        moxLog(LOG_NOTICE, "mox action: %s ordered for %s\n", systemControlName(controlCode), event);
 }
 
 int actionLogSendEmail(EmailConfig* config, const EventRecord* record)
@@ -147,9 +189,12 @@ void actionLogStartupCheck(void)
     if (h == nullptr)
         return;
     char server[EMAIL_SERVER_SIZE] = {};
-    bool serverSet = getStringValue(h, BaseboardComponentId(), emailGroup, 1, nullptr, server, sizeof server) != 0 &&
-                     server[0] != '\0';
-    unsigned rows = serverSet ? 0 : rowsAskingForEmail(h, 10) + rowsAskingForEmail(h, 4);
+    unsigned rows = 0;
+    if (!emailServerSet(h, server, sizeof server)) {
+        ActionsTableSurvey survey;
+        for (int group : {10, 4})
+            rows += surveyActionsTable(h, group, &survey) ? survey.email : 0;
+    }
     SLDestroyHandle(h);
     if (rows != 0)
         moxLog(LOG_NOTICE,

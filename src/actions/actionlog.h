@@ -26,5 +26,24 @@ void actionLogNoServer(const EventRecord* record);
 // tables ask for e-mail but the baseboard has no SMTP server.
 void actionLogStartupCheck(void);
 
+// What the enabled rows of one actions table ask for.
+struct ActionsTableSurvey {
+    unsigned rows;        // rows read
+    unsigned enabled;     // of them enabled
+    unsigned email;       // enabled rows asking for e-mail
+    unsigned alarm;       // enabled rows asking for the log line and alarm record
+    unsigned control;     // enabled rows asking for system control
+    unsigned conflicting; // enabled rows asking for more than one system-control action
+    char conflict[200];   // the first of them: its keys and those actions
+};
+// Reads actions table `group` of the own component as the carry-over copies
+// it; false when the group cannot be listed.
+bool surveyActionsTable(SLHandle* h, int group, ActionsTableSurvey* survey);
+// Whether the baseboard's e-mail settings name an SMTP server (copied to
+// `server`).
+bool emailServerSet(SLHandle* h, char* server, size_t size);
+// The name of a system-control action code.
+const char* systemControlName(uint32_t code);
+
 // "event <group> of <component>", control bytes as blanks, cut to fit out.
 void actionLogEventName(const EventRecord* record, char* out, size_t size);

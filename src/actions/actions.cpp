@@ -1,5 +1,6 @@
 #include "actions/actions.h"
 
+#include <cstdarg>
 #include <cstdio>
 #include <cstring>
 #include <syslog.h>
@@ -39,19 +40,64 @@ const char* text(const char* s)
 const ActionEntry* handlers = lscActions;
 
 // A system-control action: asks for the capability first, honours the
-// notifications-only setting, and takes the lock once for each call.
-int systemControl(uint32_t capability, uint32_t code, int32_t delay, const EventRecord* record)
+// notifications-only setting, and takes the lock once for each call. With an
+// explanation it tells the request it would make, and makes none.
+struct Control {
+    uint32_t capability;
+    uint32_t code; // of MoxInitiateSystemControlAction
+    int32_t delay; // milliseconds
+};
+constexpr Control osShutdown{0x08, 3, 200};
+constexpr Control shutdownPowerOff{0x40, 7, 40000};
+constexpr Control shutdownReset{0x10, 6, 40000};
+constexpr Control hardPowerOff{0x01, 2, 200};
+constexpr Control hardReset{0x02, 1, 200};
+constexpr Control nmi{0x04, 8, 200};
+
+int systemControl(const Control& control, const EventRecord* record, const Explanation* explain)
 {
     SystemControlInfo info;
     int rc = MoxGetSystemControlInfo(&info);
     if (rc != 0)
         return rc;
-    if ((info.capabilities & capability) == 0)
+    if ((info.capabilities & control.capability) == 0) {
+        explainLine(explain, "nothing: capability 0x%x is not offered", control.capability);
         return 0;
-    actionLogSystemControl(code, record, bNotificationOnly != 0);
+    }
+    if (explain != nullptr) {
+        if (bNotificationOnly != 0)
+            explainLine(explain, "skipped: notificationonly is set");
+        else
+            explainLine(explain, "system-control request %u (%s) with delay %d ms", control.code,
+                        systemControlName(control.code), control.delay);
+        return 0;
+    }
+    actionLogSystemControl(control.code, record, bNotificationOnly != 0);
     if (bNotificationOnly != 0)
         return 0;
-    return MoxInitiateSystemControlAction(code, delay);
+    return MoxInitiateSystemControlAction(control.code, control.delay);
+}
+
+template <const Control& control>
+void describeControl(SLHandle*, EventRecord* record, const Explanation* explain)
+{
+    systemControl(control, record, explain);
+}
+
+const char* priorityName(int priority)
+{
+    switch (priority) {
+    case LOG_EMERG:
+        return "emerg";
+    case LOG_ERR:
+        return "err";
+    case LOG_WARNING:
+        return "warning";
+    case LOG_NOTICE:
+        return "notice";
+    default:
+        return "info";
+    }
 }
 
 int severityPriority(uint32_t severity)
@@ -87,36 +133,36 @@ char* listedComponentName(SLHandle* handle, uint32_t component)
     return NewCString(SLComponentName(handle));
 }
 
-void logStandardEvent(SLHandle*, EventRecord* record)
+// The event's system-log line and its priority, chosen by the record's kind;
+// false when no line is logged.
+bool standardLogLine(EventRecord* record, char (&line)[200], int* priority)
 {
     SLHandle* handle = SLCreateHandle(0);
     if (handle == nullptr)
-        return;
+        return false;
     char label[64];
     rowLabel(handle, record, label, sizeof label);
     SLDestroyHandle(handle);
-    char line[200];
     snprintf(line, sizeof line, "TYPE:%s COMPONENT:%s GROUP:%s SEVERITY:%s ROW:%s SYSTEM:%s SUBSYSTEM:%s",
              text(record->eventTypeText), text(record->componentName), text(record->groupName),
              text(record->severityText), label, text(record->systemText), text(record->subsystemText));
-    // Every text in the line comes from the provider; the line end is ours.
-    moxBlankControls(line);
-    moxLog(severityPriority(record->severity), "%s\n", line);
+    *priority = severityPriority(record->severity);
+    return true;
 }
 
-void logBaseboardEvent(SLHandle* indication, EventRecord* record)
+bool baseboardLogLine(SLHandle* indication, EventRecord* record, char (&line)[200], int* priority)
 {
     SLHandle* handle = SLCreateHandle(0);
     if (handle == nullptr)
-        return;
+        return false;
     if (SLEventRowCount(indication, 0) == 0) {
         SLDestroyHandle(handle);
-        return;
+        return false;
     }
     SLEventSelectRowCnf(indication, 0, 0);
     if (SLRowAttributeCount(indication) == 0) {
         SLDestroyHandle(handle);
-        return;
+        return false;
     }
     uint32_t errorGroup = SLRowGroupId(indication);
     uint32_t errorAttribute = SLRowAttributeId(indication, 0);
@@ -129,50 +175,216 @@ void logBaseboardEvent(SLHandle* indication, EventRecord* record)
         enumText(handle, component, record->groupId, record->attributeId, record->attributeValue, "N/A");
     char label[64];
     rowLabel(handle, record, label, sizeof label);
-    int priority = errorValue == 0 ? LOG_INFO : errorValue == 1 ? LOG_WARNING : LOG_ERR;
-
-    char line[200];
+    *priority = errorValue == 0 ? LOG_INFO : errorValue == 1 ? LOG_WARNING : LOG_ERR;
     snprintf(line, sizeof line, "NAME:%s COMPONENT:%s GROUP:%s ROW:%s ATTRIBUTE:%s %s", name, text(componentName),
              text(GroupName(handle, component, record->groupId)), label,
              text(AttributeName(handle, component, record->groupId, record->attributeId)), value);
-    moxBlankControls(line);
-    moxLog(priority, "%s\n", line);
     SLDeleteString(componentName);
     SLDestroyHandle(handle);
+    return true;
 }
 
-void logUnknownEvent(SLHandle*, EventRecord* record)
+bool unknownLogLine(EventRecord* record, char (&line)[200], int* priority)
 {
     SLHandle* handle = SLCreateHandle(0);
     if (handle == nullptr)
-        return;
+        return false;
     char* name = listedComponentName(handle, record->componentId);
-    char line[124];
-    snprintf(line, sizeof line, "DMI Unknown Indication %s", text(name));
-    moxBlankControls(line);
-    moxLog(LOG_NOTICE, "%s\n", line);
+    // The unknown-event line is built in 124 bytes.
+    snprintf(line, 124, "DMI Unknown Indication %s", text(name));
+    *priority = LOG_NOTICE;
     SLDeleteString(name);
     SLDestroyHandle(handle);
+    return true;
+}
+
+bool eventLogLine(SLHandle* indication, EventRecord* record, char (&line)[200], int* priority)
+{
+    bool built;
+    switch (record->eventKind) {
+    case EVENT_STANDARD:
+        built = standardLogLine(record, line, priority);
+        break;
+    case EVENT_VENDOR:
+        built = baseboardLogLine(indication, record, line, priority);
+        break;
+    default:
+        built = unknownLogLine(record, line, priority);
+        break;
+    }
+    // Every text in the line comes from the provider; the line end is ours.
+    if (built)
+        moxBlankControls(line);
+    return built;
+}
+
+// The console line without its line end; false when there is none.
+bool consoleLine(EventRecord* record, char* out, size_t size)
+{
+    char* message = createEventMessage(record);
+    if (message == nullptr)
+        return false;
+    moxBlankControls(message);
+    snprintf(out, size, "MOX: %s", message);
+    SLDeleteString(message);
+    return true;
+}
+
+// The broadcast text without its line end; false when the group cannot be listed.
+bool broadcastText(EventRecord* record, char* out, size_t size)
+{
+    SLHandle* handle = SLCreateHandle(0);
+    if (handle == nullptr)
+        return false;
+    char* name = nullptr;
+    if (SLListGroup(handle, record->componentId, record->groupId) == 0)
+        name = NewCString(SLGroupName(handle, 0));
+    SLDestroyHandle(handle);
+    if (name == nullptr)
+        return false;
+    // The name is cleaned, not the message: its line ends are the daemon's.
+    moxBlankControls(name);
+    snprintf(out, size, "Please check group %s on this machine", name);
+    SLDeleteString(name);
+    return true;
+}
+
+void lcdText(EventRecord* record, char (&line)[LcdWidth + 1])
+{
+    char message[1024];
+    snprintf(message, sizeof message, "Check: %s", text(record->groupName));
+    moxBlankControls(message);
+    LcdLine(message, line);
+}
+
+// ---------------------------------------------------------------------------
+// What each action would do, for an explanation.
+
+void describeConsoleMessage(SLHandle*, EventRecord* record, const Explanation* explain)
+{
+    char line[1100];
+    if (consoleLine(record, line, sizeof line))
+        explainLine(explain, "standard error: %s", line);
+    else
+        explainLine(explain, "nothing: no message can be made");
+}
+
+void describeBeepSpeaker(SLHandle*, EventRecord*, const Explanation* explain)
+{
+    explainLine(explain, "the bell (byte 0x07) on standard output");
+}
+
+void describeAlarm(EventRecord* record, const Explanation* explain)
+{
+    AlarmRecord alarm = makeAlarmRecord(record);
+    char record28[128];
+    snprintf(record28, sizeof record28,
+             "alarm record component %u group %u event group %u severity %u instance %u power %u",
+             alarm.componentId, alarm.groupId, alarm.eventGroupId, alarm.severity, alarm.instance, alarm.powerFlag);
+    KobPaths paths = defaultKobPaths();
+    char pid[20] = {};
+    switch (kobPeerAt(paths, pid)) {
+    case KobPeer::Running:
+        explainLine(explain, "%s to %s (kobd runs, process %s)", record28, paths.fifo, pid);
+        break;
+    case KobPeer::Stale:
+        explainLine(explain, "%s not sent: %s names no running kobd; it and %s would be removed", record28,
+                    paths.lockFile, paths.fifo);
+        break;
+    case KobPeer::Gone:
+        explainLine(explain, "%s not sent: the process %s names (%s) has ended", record28, paths.lockFile, pid);
+        break;
+    case KobPeer::None:
+        explainLine(explain, "%s not sent: no alarm peer (no %s)", record28, paths.lockFile);
+        break;
+    }
+}
+
+void describeLogEvent(SLHandle* indication, EventRecord* record, const Explanation* explain)
+{
+    describeAlarm(record, explain);
+    char line[200];
+    int priority;
+    if (eventLogLine(indication, record, line, &priority))
+        explainLine(explain, "system log at %s: %s", priorityName(priority), line);
+    else
+        explainLine(explain, "no system-log line: the event's row cannot be read");
+}
+
+void describeWriteToLCD(SLHandle*, EventRecord* record, const Explanation* explain)
+{
+    if (LcdGroupId == 0) {
+        explainLine(explain, "nothing: the baseboard has no status display");
+        return;
+    }
+    char line[LcdWidth + 1];
+    lcdText(record, line);
+    explainLine(explain, "LCD (group %u, attribute %u of component %u): \"%s\"", LcdGroupId, LcdContentsAttrId,
+                BaseboardComponentId(), line);
+}
+
+void describeBroadcastMessage(SLHandle*, EventRecord* record, const Explanation* explain)
+{
+    char message[1024];
+    if (broadcastText(record, message, sizeof message))
+        explainLine(explain, "system log at emerg (every logged-in user): %s", message);
+    else
+        explainLine(explain, "nothing: group %u of component %u cannot be listed", record->groupId,
+                    record->componentId);
+}
+
+void describeTarget(bool found, const SysCtrlTarget& target, const char* what, const Explanation* explain)
+{
+    if (found)
+        explainLine(explain, "\"%s\" to attribute %u of group %u of component %u", target.value, target.attribute,
+                    target.group, target.component);
+    else
+        explainLine(explain, "nothing: no %s group", what);
+}
+
+void describeIssuePage(SLHandle*, EventRecord*, const Explanation* explain)
+{
+    SysCtrlTarget target;
+    describeTarget(SysCtrlPageTarget(&target), target, "paging", explain);
+}
+
+template <bool blink> void describeIdLed(SLHandle*, EventRecord*, const Explanation* explain)
+{
+    SysCtrlTarget target;
+    describeTarget(SysCtrlIdLedTarget(blink, &target), target, "system-control", explain);
+}
+
+// Prefixes each line of a describer with the action's code and name.
+struct ActionLines {
+    const Explanation* outer;
+    const ActionEntry* entry;
+};
+
+void actionLine(void* context, const char* text)
+{
+    auto* lines = static_cast<ActionLines*>(context);
+    const char* name = lines->entry->name != nullptr ? lines->entry->name : "(unnamed)";
+    explainLine(lines->outer, "action %u %s: %s", lines->entry->code, name, text);
 }
 
 } // namespace
 
 const ActionEntry lscActions[] = {
-    {7, BeepSpeaker},
-    {8, ConsoleMessage},
-    {9, LogEvent},
-    {10, writeToLCD},
-    {11, shutdownOS},
-    {12, shutdownAndPowerOff},
-    {13, shutdownAndresetsystem},
-    {14, powerOff},
-    {15, resetSystem},
-    {16, BroadcastMessage},
-    {18, issueNMI},
-    {19, issuePage},
-    {20, MoxSendEmail},
-    {21, MoxIdLedOff},
-    {22, MoxIdLedBlink},
+    {7, BeepSpeaker, describeBeepSpeaker, "BeepSpeaker"},
+    {8, ConsoleMessage, describeConsoleMessage, "ConsoleMessage"},
+    {9, LogEvent, describeLogEvent, "LogEvent"},
+    {10, writeToLCD, describeWriteToLCD, "writeToLCD"},
+    {11, shutdownOS, describeControl<osShutdown>, "shutdownOS"},
+    {12, shutdownAndPowerOff, describeControl<shutdownPowerOff>, "shutdownAndPowerOff"},
+    {13, shutdownAndresetsystem, describeControl<shutdownReset>, "shutdownAndresetsystem"},
+    {14, powerOff, describeControl<hardPowerOff>, "powerOff"},
+    {15, resetSystem, describeControl<hardReset>, "resetSystem"},
+    {16, BroadcastMessage, describeBroadcastMessage, "BroadcastMessage"},
+    {18, issueNMI, describeControl<nmi>, "issueNMI"},
+    {19, issuePage, describeIssuePage, "issuePage"},
+    {20, MoxSendEmail, describeMoxSendEmail, "MoxSendEmail"},
+    {21, MoxIdLedOff, describeIdLed<false>, "MoxIdLedOff"},
+    {22, MoxIdLedBlink, describeIdLed<true>, "MoxIdLedBlink"},
     {0, nullptr},
 };
 
@@ -185,14 +397,105 @@ const ActionEntry* actionsSetHandlers(const ActionEntry* table)
 
 void DoAction(uint32_t code, uint32_t value, SLHandle* indication, EventRecord* record)
 {
+    dispatchAction(code, value, indication, record, nullptr);
+}
+
+void dispatchAction(uint32_t code, uint32_t value, SLHandle* indication, EventRecord* record,
+                    const Explanation* explain)
+{
     if (value == 0)
         return;
     for (const ActionEntry* entry = handlers; entry->code != 0; ++entry) {
-        if (entry->code == code) {
+        if (entry->code != code)
+            continue;
+        if (explain == nullptr) {
             entry->handler(indication, record);
-            return;
+        } else if (entry->describe != nullptr) {
+            ActionLines lines{explain, entry};
+            Explanation prefixed{actionLine, &lines};
+            entry->describe(indication, record, &prefixed);
+        } else {
+            explainLine(explain, "action %u: its handler cannot describe itself", code);
         }
+        return;
     }
+}
+
+const char* actionName(uint32_t code)
+{
+    for (const ActionEntry* entry = lscActions; entry->code != 0; ++entry) {
+        if (entry->code == code)
+            return entry->name;
+    }
+    return nullptr;
+}
+
+bool isSystemControlAction(uint32_t code)
+{
+    return (code >= 11 && code <= 15) || code == 18;
+}
+
+void explainLine(const Explanation* explain, const char* format, ...)
+{
+    if (explain == nullptr)
+        return;
+    char line[2048];
+    va_list arguments;
+    va_start(arguments, format);
+    vsnprintf(line, sizeof line, format, arguments);
+    va_end(arguments);
+    moxBlankControls(line);
+    explain->line(explain->context, line);
+}
+
+void explainKeys(const SLKeyList* keys, char* out, unsigned size)
+{
+    if (size == 0)
+        return;
+    out[0] = '\0';
+    size_t used = 0;
+    uint32_t count = keys == nullptr ? 0 : keys->count < SL_MAX_KEYS ? keys->count : SL_MAX_KEYS;
+    for (uint32_t i = 0; i < count && used < size; ++i) {
+        const SLKeyEntry& key = keys->keys[i];
+        const char* separator = i == 0 ? "" : " ";
+        int n;
+        if (key.value == nullptr)
+            n = snprintf(out + used, size - used, "%s%u=(none)", separator, key.attributeId);
+        else if (key.type == DMI_OCTETSTRING || key.type == DMI_DISPLAYSTRING)
+            n = snprintf(out + used, size - used, "%s%u=\"%.*s\"", separator, key.attributeId,
+                         static_cast<int>(dmiStringLength(static_cast<const DmiString*>(key.value))),
+                         dmiStringText(static_cast<const DmiString*>(key.value)));
+        else
+            n = snprintf(out + used, size - used, "%s%u=%d", separator, key.attributeId,
+                         static_cast<int32_t>(loadWord(key.value)));
+        used += n > 0 ? static_cast<size_t>(n) : 0;
+    }
+    if (count == 0)
+        snprintf(out, size, "(none)");
+}
+
+void explainRecord(const Explanation* explain, const EventRecord* record)
+{
+    if (explain == nullptr)
+        return;
+    char instance[24] = "none";
+    if (record->keyList != nullptr && record->keyList->count != 0 && record->keyList->keys[0].value != nullptr)
+        snprintf(instance, sizeof instance, "%d", static_cast<int32_t>(loadWord(record->keyList->keys[0].value)));
+    if (record->eventKind == EVENT_STANDARD)
+        explainLine(explain,
+                    "standard event of component %u (%s): event group %u, type %u (%s), severity %u (%s), "
+                    "system %u (%s), subsystem %u (%s), group %u (%s), instance %s",
+                    record->componentId, text(record->componentName), record->eventGroupId, record->eventType,
+                    text(record->eventTypeText), record->severity, text(record->severityText), record->eventSystem,
+                    text(record->systemText), record->eventSubsystem, text(record->subsystemText), record->groupId,
+                    text(record->groupName), instance);
+    else
+        explainLine(explain,
+                    "vendor event of component %u (%s): error state %u, group %u (%s), attribute %u (%s), "
+                    "value %u, instance %s",
+                    record->componentId, text(record->componentName), record->errorState, record->groupId,
+                    text(record->groupName), record->attributeId, text(record->attributeName),
+                    record->attributeValue, instance);
 }
 
 char* createEventMessage(EventRecord* record)
@@ -231,12 +534,9 @@ void rowLabel(SLHandle* handle, EventRecord* record, char* out, unsigned size)
 
 int ConsoleMessage(SLHandle*, EventRecord* record)
 {
-    char* message = createEventMessage(record);
-    if (message != nullptr) {
-        moxBlankControls(message);
-        fprintf(stderr, "MOX: %s\n", message);
-        SLDeleteString(message);
-    }
+    char line[1100];
+    if (consoleLine(record, line, sizeof line))
+        fprintf(stderr, "%s\n", line);
     return 0;
 }
 
@@ -252,46 +552,26 @@ int BeepSpeaker(SLHandle*, EventRecord*)
 int LogEvent(SLHandle* indication, EventRecord* record)
 {
     KOBProcessAlarm(record);
-    switch (record->eventKind) {
-    case EVENT_STANDARD:
-        logStandardEvent(indication, record);
-        break;
-    case EVENT_VENDOR:
-        logBaseboardEvent(indication, record);
-        break;
-    default:
-        logUnknownEvent(indication, record);
-        break;
-    }
+    char line[200];
+    int priority;
+    if (eventLogLine(indication, record, line, &priority))
+        moxLog(priority, "%s\n", line);
     return 0;
 }
 
 int BroadcastMessage(SLHandle*, EventRecord* record)
 {
-    SLHandle* handle = SLCreateHandle(0);
-    if (handle == nullptr)
-        return 0;
-    char* name = nullptr;
-    if (SLListGroup(handle, record->componentId, record->groupId) == 0)
-        name = NewCString(SLGroupName(handle, 0));
-    if (name != nullptr) {
-        // The name is cleaned, not the message: its line end is the daemon's.
-        moxBlankControls(name);
-        char message[1024];
-        snprintf(message, sizeof message, "Please check group %s on this machine\n", name);
-        moxLog(LOG_EMERG, "%s\n", message);
-        SLDeleteString(name);
-    }
-    SLDestroyHandle(handle);
+    char message[1024];
+    if (broadcastText(record, message, sizeof message))
+        moxLog(LOG_EMERG, "%s\n\n", message);
     return 0;
 }
 
 int writeToLCD(SLHandle*, EventRecord* record)
 {
-    char message[1024];
-    snprintf(message, sizeof message, "Check: %s", text(record->groupName));
-    moxBlankControls(message);
-    WriteLCD(message);
+    char line[LcdWidth + 1];
+    lcdText(record, line);
+    WriteLCD(line);
     return 0;
 }
 
@@ -315,30 +595,30 @@ int MoxIdLedBlink(SLHandle*, EventRecord*)
 
 int shutdownOS(SLHandle*, EventRecord* record)
 {
-    return systemControl(0x08, 3, 200, record);
+    return systemControl(osShutdown, record, nullptr);
 }
 
 int shutdownAndPowerOff(SLHandle*, EventRecord* record)
 {
-    return systemControl(0x40, 7, 40000, record);
+    return systemControl(shutdownPowerOff, record, nullptr);
 }
 
 int shutdownAndresetsystem(SLHandle*, EventRecord* record)
 {
-    return systemControl(0x10, 6, 40000, record);
+    return systemControl(shutdownReset, record, nullptr);
 }
 
 int powerOff(SLHandle*, EventRecord* record)
 {
-    return systemControl(0x01, 2, 200, record);
+    return systemControl(hardPowerOff, record, nullptr);
 }
 
 int resetSystem(SLHandle*, EventRecord* record)
 {
-    return systemControl(0x02, 1, 200, record);
+    return systemControl(hardReset, record, nullptr);
 }
 
 int issueNMI(SLHandle*, EventRecord* record)
 {
-    return systemControl(0x04, 8, 200, record);
+    return systemControl(nmi, record, nullptr);
 }

@@ -10,9 +10,29 @@
 // are ignored.
 typedef int (*ActionHandler)(SLHandle* indication, EventRecord* record);
 
+// An explanation: what the matchers and the dispatcher would do for an event,
+// told line by line instead of done. They take one where they act; null means
+// carry the actions out.
+struct Explanation {
+    void (*line)(void* context, const char* text); // one line, without its line end
+    void* context;
+};
+// One formatted line, control bytes as blanks; nothing when `explain` is null.
+void explainLine(const Explanation* explain, const char* format, ...) __attribute__((format(printf, 2, 3)));
+// The keys of a key list as "id=value ...", for an explanation.
+void explainKeys(const SLKeyList* keys, char* out, unsigned size);
+// The event record's kind, component and values, as one explanation line.
+void explainRecord(const Explanation* explain, const EventRecord* record);
+
+// Tells what an action would do for the event without doing anything of it:
+// each line it gives to `explain` goes out behind the action's name.
+typedef void (*ActionDescriber)(SLHandle* indication, EventRecord* record, const Explanation* explain);
+
 struct ActionEntry {
     uint32_t code; // 0 ends the table
     ActionHandler handler;
+    ActionDescriber describe = nullptr;
+    const char* name = nullptr; // as mox(8) names the action
 };
 
 // Action code and the position of its switch in an actions-table row read
@@ -26,6 +46,14 @@ extern const ActionEntry lscActions[];
 
 // Runs the handler of `code` when `value` is non-zero.
 void DoAction(uint32_t code, uint32_t value, SLHandle* indication, EventRecord* record);
+// The same, or with an explanation the description of what the handler would
+// do; it then does nothing.
+void dispatchAction(uint32_t code, uint32_t value, SLHandle* indication, EventRecord* record,
+                    const Explanation* explain);
+// The name of action `code` in the handler table, null for none.
+const char* actionName(uint32_t code);
+// Whether action `code` controls the system (shutdown, power off, reset, NMI).
+bool isSystemControlAction(uint32_t code);
 
 int ConsoleMessage(SLHandle* indication, EventRecord* record);
 int BeepSpeaker(SLHandle* indication, EventRecord* record);

@@ -15,10 +15,10 @@
 #include "base/sleep.h"
 
 uint32_t bNotificationOnly = 0;
+const char* const MoxConfigFile = "/usr/local/ubo/bin/mox.cfg";
 
 namespace {
 pthread_mutex_t MoxSyncMutex = PTHREAD_MUTEX_INITIALIZER;
-const char* const configFile = "/usr/local/ubo/bin/mox.cfg";
 const char* const initProgram = "/sbin/init";
 } // namespace
 
@@ -90,5 +90,5 @@ int processCfgFile(const char* path)
 
 int ProcessCfgOption(void)
 {
-    return processCfgFile(configFile);
+    return processCfgFile(MoxConfigFile);
 }

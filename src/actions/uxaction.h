@@ -14,6 +14,8 @@ void MoxDelay(int32_t milliseconds);
 // Replaces the process with "/sbin/init 0"; returns only on failure.
 int MoxShutDownOs(void);
 int GetOSType(void);
+// "/usr/local/ubo/bin/mox.cfg", the configuration file.
+extern const char* const MoxConfigFile;
 // Reads "/usr/local/ubo/bin/mox.cfg"; 1 when read, 0 when it cannot be opened.
 int ProcessCfgOption(void);
 

@@ -111,20 +111,20 @@ void classPrefix(SLHandle* handle, const DmiString* classString, char (&prefix)[
 
 void eventActions(SLHandle* handle)
 {
-    if (SLEventClassCount(handle) == 0)
-        return;
-    const DmiString* classString = SLEventClassStringUnchecked(handle, 0);
-    if (classString == nullptr)
-        return;
-    char prefix[17];
-    classPrefix(handle, classString, prefix);
     const EventCallees& calls = callees;
-    if (strnicmp(prefix, zorekEventClassName, 11) == 0)
+    switch (eventClass(handle)) {
+    case EVENT_VENDOR:
         calls.vendor(handle);
-    else if (strnicmp(prefix, stdEventClassName, 16) == 0)
+        break;
+    case EVENT_STANDARD:
         calls.standard(handle);
-    else
+        break;
+    case EVENT_UNKNOWN:
         calls.unknown(handle);
+        break;
+    default:
+        break;
+    }
 }
 
 void* eventHandlerThread(void*)
@@ -147,6 +147,43 @@ void* eventHandlerThread(void*)
 }
 
 } // namespace
+
+uint32_t eventClass(SLHandle* handle)
+{
+    if (SLEventClassCount(handle) == 0)
+        return 0;
+    const DmiString* classString = SLEventClassStringUnchecked(handle, 0);
+    if (classString == nullptr)
+        return 0;
+    char prefix[17];
+    classPrefix(handle, classString, prefix);
+    if (strnicmp(prefix, zorekEventClassName, 11) == 0)
+        return EVENT_VENDOR;
+    if (strnicmp(prefix, stdEventClassName, 16) == 0)
+        return EVENT_STANDARD;
+    return EVENT_UNKNOWN;
+}
+
+void explainEventActions(SLHandle* handle, const Explanation* explain)
+{
+    uint32_t kind = eventClass(handle);
+    const DmiString* classString = kind != 0 ? SLEventClassString(handle, 0) : nullptr;
+    if (classString != nullptr)
+        explainLine(explain, "event class \"%.*s\": %s", static_cast<int>(dmiStringLength(classString)),
+                    dmiStringText(classString),
+                    kind == EVENT_STANDARD ? "a standard event" : kind == EVENT_VENDOR ? "a vendor event" : "unknown");
+    switch (kind) {
+    case EVENT_VENDOR:
+        zorekEventActions(handle, explain);
+        break;
+    case EVENT_STANDARD:
+        stdEventActions(handle, explain);
+        break;
+    default:
+        explainLine(explain, "the event's class is neither standard nor vendor: only its unknown-event log line");
+        break;
+    }
+}
 
 EventCallees eventsDefaultCallees()
 {

@@ -7,6 +7,7 @@
 
 #include <cstdint>
 
+#include "actions/actions.h"
 #include "sl/sltypes.h"
 
 // The indication handler: queues a copy of `handle` (never takes `handle`
@@ -36,3 +37,9 @@ int eventsWorkersRunning();
 unsigned eventsQueued();
 // Runs the worker's classification of one handle on the calling thread.
 void processEvent(SLHandle* handle);
+// The class of an event indication as the worker tells it by its class 0
+// string: EVENT_VENDOR, EVENT_STANDARD or EVENT_UNKNOWN; 0 without a class.
+uint32_t eventClass(SLHandle* handle);
+// The worker's handling of one event indication, told to `explain` instead of
+// carried out: nothing is done.
+void explainEventActions(SLHandle* handle, const Explanation* explain);

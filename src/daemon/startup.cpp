@@ -45,10 +45,19 @@ MarkerCheck defaultMarkerCheck()
                        stdout};
 }
 
-int checkForMoxNot(const MarkerCheck& check)
+const char* localMarker(const MarkerCheck& check)
 {
     // In the working directory vornmox.not comes first; on the floppy mox.not.
-    if (moxCanOpen(check.localVornmox) || moxCanOpen(check.localMox))
+    for (const char* marker : {check.localVornmox, check.localMox}) {
+        if (moxCanOpen(marker))
+            return marker;
+    }
+    return nullptr;
+}
+
+int checkForMoxNot(const MarkerCheck& check)
+{
+    if (localMarker(check) != nullptr)
         return 4;
     tell(check, "Checking for mox configurations ..\n", "\nChecking for mox configurations ..\n");
     if (check.run(check.mountCommand) != 0) {
@@ -78,16 +87,11 @@ int check_for_moxnot(void)
     return checkForMoxNot(defaultMarkerCheck());
 }
 
-namespace {
-
-// Registration ends by finding the baseboard groups, system control first.
 void findBaseboardGroups()
 {
     SysCtrlInitialize();
     LcdInitialize();
 }
-
-} // namespace
 
 int init_routine(void)
 {

@@ -11,6 +11,8 @@ void* mainThread(void* unused);
 // 0, or the non-zero result of RegisterWithSL.
 int init_routine(void);
 int unload(void);
+// Registration ends by finding the baseboard groups, system control first.
+void findBaseboardGroups();
 // Opens /dev/null on each of descriptors 0, 1 and 2 that is closed: the number
 // opened, or -1 when /dev/null cannot be opened.
 int openStandardDescriptors();
@@ -27,4 +29,7 @@ struct MarkerCheck {
     FILE* out;                       // standard output in the daemon
 };
 MarkerCheck defaultMarkerCheck();
+// The marker file in the working directory that disables the daemon (the
+// first found), or null; the floppy is not looked at.
+const char* localMarker(const MarkerCheck& check);
 int checkForMoxNot(const MarkerCheck& check);

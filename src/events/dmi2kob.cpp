@@ -98,34 +98,35 @@ AlarmRecord makeAlarmRecord(EventRecord* record)
     return alarm;
 }
 
-int kobProcessAlarmAt(const KobPaths& paths, EventRecord* record)
+KobPeer kobPeerAt(const KobPaths& paths, char (&pid)[20])
 {
-    char pid[20] = {};
     bool present = false;
-    if (!readPid(paths.lockFile, pid, present)) {
-        // A lock that names no process id is stale; nothing else is opened.
-        if (present) {
-            unlink(paths.lockFile);
-            unlink(paths.fifo);
-        }
-        return 0;
-    }
+    if (!readPid(paths.lockFile, pid, present))
+        return present ? KobPeer::Stale : KobPeer::None; // a lock naming no process id is stale
     char cmdlinePath[64];
     snprintf(cmdlinePath, sizeof cmdlinePath, paths.cmdline, pid);
     FILE* cmdline = fopen(cmdlinePath, "r");
     if (cmdline == nullptr)
-        return 0;
+        return KobPeer::Gone;
     // The arguments are separated by NULs, so the comparison ends with the
     // program name as it was started.
     char name[32] = {};
     if (fscanf(cmdline, "%31s", name) != 1)
         name[0] = '\0';
     fclose(cmdline);
-    if (strcmp(name, "kobd") != 0) {
+    return strcmp(name, "kobd") == 0 ? KobPeer::Running : KobPeer::Stale;
+}
+
+int kobProcessAlarmAt(const KobPaths& paths, EventRecord* record)
+{
+    char pid[20] = {};
+    KobPeer peer = kobPeerAt(paths, pid);
+    if (peer == KobPeer::Stale) {
         unlink(paths.lockFile);
         unlink(paths.fifo);
-        return 0;
     }
+    if (peer != KobPeer::Running)
+        return 0;
 
     AlarmRecord alarm = makeAlarmRecord(record);
     int fd = openFifo(paths.fifo, paths.openWaitMs);

@@ -33,5 +33,14 @@ struct KobPaths {
     unsigned openWaitMs; // how long to wait for the reader to open the FIFO
 };
 KobPaths defaultKobPaths();
+// What the lock file says of the alarm peer; the process id it names in `pid`.
+// Looks only: the hand-off removes a stale lock and the FIFO.
+enum class KobPeer {
+    None,    // no lock file that can be read
+    Stale,   // it names no process id, or a process that is not kobd
+    Gone,    // the process it names cannot be looked at (ended); left alone
+    Running, // kobd runs
+};
+KobPeer kobPeerAt(const KobPaths& paths, char (&pid)[20]);
 int kobProcessAlarmAt(const KobPaths& paths, EventRecord* record);
 AlarmRecord makeAlarmRecord(EventRecord* record);

@@ -31,11 +31,13 @@ void fillKey(SLKeyList* keys, uint32_t* mifId, uint32_t* group, uint32_t* instan
     }
 }
 
-void matchZorekEvents(SLHandle* indication, EventRecord* record)
+void matchZorekEvents(SLHandle* indication, EventRecord* record, const Explanation* explain)
 {
     uint32_t mifId = GetMifId(record->componentId);
-    if (mifId == 0)
+    if (mifId == 0) {
+        explainLine(explain, "component %u is not a supported component: nothing runs", record->componentId);
         return;
+    }
     uint32_t group = record->groupId;
     uint32_t attribute = record->attributeId;
     uint32_t value = record->attributeValue;
@@ -60,18 +62,30 @@ void matchZorekEvents(SLHandle* indication, EventRecord* record)
         uint32_t instance, value;
     } tries[] = {{eventInstance, value}, {eventInstance, anyValue}, {0, value}, {0, anyValue}};
     uint32_t own = MyComponentId();
+    explainLine(explain, "actions table: group %u of component %u", vendorActionsGroup, own);
+    bool found = false;
+    int attempt = 0;
     for (const auto& t : tries) {
         instance = t.instance;
         lookupValue = t.value;
-        if (SLGetRow(handle, own, vendorActionsGroup, firstActionAttribute, &keys) == 0) {
-            runRowActions(handle, indication, record);
+        found = SLGetRow(handle, own, vendorActionsGroup, firstActionAttribute, &keys) == 0;
+        explainTry(explain, ++attempt, &keys, found);
+        if (found) {
+            runRowActions(handle, indication, record, explain);
             break;
         }
     }
+    if (!found)
+        explainLine(explain, "no row matched: nothing runs");
     SLDestroyHandle(handle);
 }
 
 void ZorekEventActions(SLHandle* indication)
+{
+    zorekEventActions(indication, nullptr);
+}
+
+void zorekEventActions(SLHandle* indication, const Explanation* explain)
 {
     EventRecord record{};
     record.eventKind = EVENT_VENDOR;
@@ -109,8 +123,12 @@ void ZorekEventActions(SLHandle* indication)
             }
         }
     }
-    if (match)
-        matchZorekEvents(indication, &record);
+    if (match) {
+        explainRecord(explain, &record);
+        matchZorekEvents(indication, &record, explain);
+    } else {
+        explainLine(explain, "the event's rows cannot be read: nothing runs");
+    }
     SLDeleteKeyList(record.keyList);
     SLDestroyHandle(lookup);
 }

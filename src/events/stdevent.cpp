@@ -69,6 +69,15 @@ uint32_t readEventRow(SLHandle* indication, SLHandle* lookup, EventRecord* recor
 
 } // namespace
 
+void explainTry(const Explanation* explain, int attempt, const SLKeyList* keys, bool found)
+{
+    if (explain == nullptr)
+        return;
+    char text[400];
+    explainKeys(keys, text, sizeof text);
+    explainLine(explain, "try %d: keys %s: %s", attempt, text, found ? "row found" : "no row");
+}
+
 uint32_t firstKeyValue(const SLKeyList* keys)
 {
     if (keys == nullptr || keys->count == 0 || keys->keys[0].value == nullptr)
@@ -99,7 +108,7 @@ int modifyKey(SLKeyList* keys, uint32_t mifId, uint32_t eventGroupId, uint32_t e
     return 0;
 }
 
-void runRowActions(SLHandle* row, SLHandle* indication, EventRecord* record)
+void runRowActions(SLHandle* row, SLHandle* indication, EventRecord* record, const Explanation* explain)
 {
     uint32_t count = slRowAttributesPresent(row);
     char* alert = nullptr;
@@ -108,26 +117,36 @@ void runRowActions(SLHandle* row, SLHandle* indication, EventRecord* record)
         if (id == 17 && SLRowAttributeType(row, i) == DMI_DISPLAYSTRING && alert == nullptr) {
             alert = NewCString(SLRowStringPtr(row, i));
         } else if (id == 30 && SLRowUnsignedValue(row, i) == 0) {
+            explainLine(explain, "row disabled (attribute 30 is 0), alert name \"%s\": nothing runs",
+                        alert != nullptr ? alert : "");
             SLDeleteString(alert); // the row is disabled
             return;
         }
     }
+    explainLine(explain, "row enabled, alert name \"%s\"", alert != nullptr ? alert : "");
     if (alert != nullptr) {
-        IssueOrRegisterAlert(alert, record, 0);
+        if (explain == nullptr)
+            IssueOrRegisterAlert(alert, record, 0);
         SLDeleteString(alert);
     }
+    bool any = false;
     for (uint32_t i = 0; ActionID[i].code != 0 && i < count; ++i) {
         uint32_t position = ActionID[i].position;
         uint32_t value = position < count ? SLRowUnsignedValue(row, position) : 0;
-        DoAction(ActionID[i].code, value, indication, record);
+        any |= value != 0;
+        dispatchAction(ActionID[i].code, value, indication, record, explain);
     }
+    if (!any)
+        explainLine(explain, "no action is switched on in the row");
 }
 
-void matchStdEvents(SLHandle* indication, EventRecord* record)
+void matchStdEvents(SLHandle* indication, EventRecord* record, const Explanation* explain)
 {
     uint32_t mifId = GetMifId(record->componentId);
-    if (mifId == 0)
+    if (mifId == 0) {
+        explainLine(explain, "component %u is not a supported component: nothing runs", record->componentId);
         return;
+    }
     // The baseboard's rows carry severity 0 and serve every severity.
     uint32_t severity = mifId == 1 ? 0 : record->severity;
     uint32_t instance = firstKeyValue(record->keyList);
@@ -136,29 +155,38 @@ void matchStdEvents(SLHandle* indication, EventRecord* record)
     if (handle == nullptr)
         return;
     uint32_t own = MyComponentId();
+    explainLine(explain, "actions table: group %u of component %u", standardActionsGroup, own);
     SLKeyList* keys = nullptr;
     if (SLGetFirstRow(handle, own, standardActionsGroup, 0, nullptr) == 0)
         keys = SLCreateKeyList(handle);
     bool found = false;
     if (keys != nullptr) {
         // The exact instance first, then the row that serves every instance.
+        int attempt = 0;
         for (uint32_t tryInstance : {instance, 0u}) {
             if (modifyKey(keys, mifId, record->eventGroupId, record->eventType, tryInstance, severity,
                           record->eventSystem, record->eventSubsystem) != 0)
                 break;
-            if (SLGetRow(handle, own, standardActionsGroup, firstActionAttribute, keys) == 0) {
-                found = true;
+            found = SLGetRow(handle, own, standardActionsGroup, firstActionAttribute, keys) == 0;
+            explainTry(explain, ++attempt, keys, found);
+            if (found)
                 break;
-            }
         }
         SLDeleteKeyList(keys);
     }
     if (found)
-        runRowActions(handle, indication, record);
+        runRowActions(handle, indication, record, explain);
+    else
+        explainLine(explain, "no row matched: nothing runs");
     SLDestroyHandle(handle);
 }
 
 void StdEventActions(SLHandle* indication)
+{
+    stdEventActions(indication, nullptr);
+}
+
+void stdEventActions(SLHandle* indication, const Explanation* explain)
 {
     EventRecord record{};
     record.eventKind = EVENT_STANDARD;
@@ -172,32 +200,36 @@ void StdEventActions(SLHandle* indication)
     record.componentId = SLEventComponentId(indication, 0);
     record.componentName = ComponentName(record.componentId);
     if (GetMifId(record.componentId) == 0 || SLEventRowCount(indication, 0) == 0) {
+        explainLine(explain, "component %u is not a supported component: nothing runs", record.componentId);
         SLDestroyHandle(lookup);
         return;
     }
     SLEventSelectRowCnf(indication, 0, 0);
     record.eventGroupId = SLRowGroupId(indication);
     if (SLRowAttributeCount(indication) <= 6) {
+        explainLine(explain, "the event-generation row has 6 attributes or fewer: nothing runs");
         SLDestroyHandle(lookup);
         return;
     }
     uint32_t instanceData = readEventRow(indication, lookup, &record);
     if (instanceData != 0 && SLEventClassCount(indication) >= 2) {
-        if (SLEventRowCount(indication, 1) == 0) {
+        bool readable = SLEventRowCount(indication, 1) != 0;
+        if (readable) {
+            SLEventSelectRowCnf(indication, 1, 0);
+            record.groupId = SLRowGroupId(indication);
+            if (SLKeyCount(indication) > 0) {
+                record.keyList = SLCreateKeyList(indication);
+                readable = record.keyList != nullptr;
+            }
+        }
+        if (!readable) {
+            explainLine(explain, "the instance row cannot be read: nothing runs");
             SLDestroyHandle(lookup);
             return;
         }
-        SLEventSelectRowCnf(indication, 1, 0);
-        record.groupId = SLRowGroupId(indication);
-        if (SLKeyCount(indication) > 0) {
-            record.keyList = SLCreateKeyList(indication);
-            if (record.keyList == nullptr) {
-                SLDestroyHandle(lookup);
-                return;
-            }
-        }
     }
-    matchStdEvents(indication, &record);
+    explainRecord(explain, &record);
+    matchStdEvents(indication, &record, explain);
     SLDeleteKeyList(record.keyList);
     SLDestroyHandle(lookup);
 }

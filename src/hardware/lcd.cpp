@@ -60,6 +60,14 @@ int LcdInitialize(void)
     return LcdGroupId != 0 ? 0 : -1;
 }
 
+void LcdLine(const char* text, char (&line)[LcdWidth + 1])
+{
+    size_t n = text == nullptr ? 0 : strnlen(text, LcdWidth);
+    memcpy(line, text == nullptr ? "" : text, n);
+    memset(line + n, ' ', LcdWidth - n);
+    line[LcdWidth] = '\0';
+}
+
 void WriteLCD(const char* text)
 {
     if (LcdGroupId == 0)
@@ -68,10 +76,7 @@ void WriteLCD(const char* text)
     if (h == nullptr)
         return;
     char line[LcdWidth + 1];
-    size_t n = text == nullptr ? 0 : strnlen(text, LcdWidth);
-    memcpy(line, text == nullptr ? "" : text, n);
-    memset(line + n, ' ', LcdWidth - n);
-    line[LcdWidth] = '\0';
+    LcdLine(text, line);
     uint32_t baseboard = BaseboardComponentId();
     SLKeyList* keys = GroupKeyList(h, baseboard, LcdGroupId);
     SetPureValue(h, baseboard, LcdGroupId, LcdContentsAttrId, keys, line);

@@ -22,6 +22,9 @@ constexpr int LcdWidth = 32;
 
 // 0 when the status-display group is known (found now or earlier), -1 otherwise.
 int LcdInitialize(void);
+// The display line WriteLCD shows for `text`: cut or padded with blanks to
+// exactly 32 characters, terminated.
+void LcdLine(const char* text, char (&line)[LcdWidth + 1]);
 // Shows `text` on the display line, cut or padded with blanks to exactly 32
 // characters (a null text shows a blank line).
 void WriteLCD(const char* text);

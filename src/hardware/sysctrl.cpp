@@ -54,14 +54,25 @@ void writeRequest(SLHandle* h, uint32_t component, uint32_t group, uint32_t attr
     SetPureValue(h, component, group, attribute, keys, value);
 }
 
-void sysCtrlWrite(uint32_t attribute, const char* value)
+// The write of a request to the system-control group; false while the group
+// is not known.
+bool sysCtrlTarget(uint32_t attribute, const char* value, SysCtrlTarget* target)
 {
     if (sysCtrlGroup == 0)
+        return false;
+    *target = SysCtrlTarget{sysCtrlComponent, sysCtrlGroup, attribute, value};
+    return true;
+}
+
+void sysCtrlWrite(uint32_t attribute, const char* value)
+{
+    SysCtrlTarget target;
+    if (!sysCtrlTarget(attribute, value, &target))
         return;
     SLHandle* h = SLCreateHandle(0);
     if (h == nullptr)
         return;
-    writeRequest(h, sysCtrlComponent, sysCtrlGroup, attribute, value);
+    writeRequest(h, target.component, target.group, target.attribute, target.value);
     SLDestroyHandle(h);
 }
 
@@ -75,6 +86,29 @@ long findListedGroup(SLHandle* h, const char* text, int length)
             return i;
     }
     return -1;
+}
+
+constexpr uint32_t idLedAttribute = 25;
+
+const char* idLedText(bool blink)
+{
+    return blink ? "LED Blink" : "LED Off";
+}
+
+// The page's write: "Page" to the paging group, searched for in the baseboard
+// component while it is not known; false when there is none.
+bool pageTarget(SLHandle* h, SysCtrlTarget* target)
+{
+    uint32_t baseboard = BaseboardComponentId();
+    if (PagingGroupId == 0 && SLListComponent(h, nullptr, baseboard) == 0) {
+        long found = findListedGroup(h, PagingClassString, PagingClassLength);
+        if (found >= 0)
+            PagingGroupId = SLComponentGroupId(h, static_cast<uint32_t>(found));
+    }
+    if (PagingGroupId == 0)
+        return false;
+    *target = SysCtrlTarget{baseboard, PagingGroupId, pageControlAttribute, "Page"};
+    return true;
 }
 
 } // namespace
@@ -131,8 +165,13 @@ void SysCtrlShutDown(void) { sysCtrlWrite(17, "Shutdown OS"); }
 void SysCtrlShutAndPowerOff(void) { sysCtrlWrite(18, "Shutdown and Power Off"); }
 void SysCtrlShutAndReset(void) { sysCtrlWrite(19, "Shutdown and Hardware Reset"); }
 void SysCtrlNMI(void) { sysCtrlWrite(20, "Issue an NMI"); }
-void SysCtrlIdLedBlink(void) { sysCtrlWrite(25, "LED Blink"); }
-void SysCtrlIdLedOff(void) { sysCtrlWrite(25, "LED Off"); }
+void SysCtrlIdLedBlink(void) { sysCtrlWrite(idLedAttribute, idLedText(true)); }
+void SysCtrlIdLedOff(void) { sysCtrlWrite(idLedAttribute, idLedText(false)); }
+
+bool SysCtrlIdLedTarget(bool blink, SysCtrlTarget* target)
+{
+    return sysCtrlTarget(idLedAttribute, idLedText(blink), target);
+}
 
 // The paging group is searched for in the baseboard component, and the page
 // is written there too: its id names a baseboard group, whatever component
@@ -146,13 +185,16 @@ void SysCtrlPage(void)
     SLHandle* h = SLCreateHandle(0);
     if (h == nullptr)
         return;
-    uint32_t baseboard = BaseboardComponentId();
-    if (PagingGroupId == 0 && SLListComponent(h, nullptr, baseboard) == 0) {
-        long found = findListedGroup(h, PagingClassString, PagingClassLength);
-        if (found >= 0)
-            PagingGroupId = SLComponentGroupId(h, static_cast<uint32_t>(found));
-    }
-    if (PagingGroupId != 0)
-        writeRequest(h, baseboard, PagingGroupId, pageControlAttribute, "Page");
+    SysCtrlTarget target;
+    if (pageTarget(h, &target))
+        writeRequest(h, target.component, target.group, target.attribute, target.value);
     SLDestroyHandle(h);
+}
+
+bool SysCtrlPageTarget(SysCtrlTarget* target)
+{
+    SLHandle* h = SLCreateHandle(0);
+    bool found = h != nullptr && pageTarget(h, target);
+    SLDestroyHandle(h);
+    return found;
 }

@@ -44,3 +44,17 @@ void SysCtrlIdLedOff(void);
 // Pages through the baseboard's paging-configuration group, searching for
 // it first while it is not known.
 void SysCtrlPage(void);
+
+// The write a request makes: component, group, attribute and value text.
+struct SysCtrlTarget {
+    uint32_t component;
+    uint32_t group;
+    uint32_t attribute;
+    const char* value;
+};
+// The write SysCtrlIdLedBlink (blink) or SysCtrlIdLedOff makes; false when it
+// makes none.
+bool SysCtrlIdLedTarget(bool blink, SysCtrlTarget* target);
+// The write SysCtrlPage makes, searching for the paging group as it does;
+// false when it makes none.
+bool SysCtrlPageTarget(SysCtrlTarget* target);

@@ -157,16 +157,11 @@ ComponentInfo* lastEntry(ComponentInfo* entry)
 // ---------------------------------------------------------------------------
 // Registration helpers.
 
-// The path SLInstallMIF gives the provider for `file`.
-std::string mifPath(const char* file)
-{
-    const char* dir = getenv("UXDMIPATH");
-    return std::string(dir != nullptr ? dir : "/var/dmi/mifs/backup") + "/" + file;
-}
-
+// Whether the file SLInstallMIF would give the provider can be read.
 bool mifReadable(const char* file)
 {
-    FILE* f = moxOpenRegular(mifPath(file).c_str());
+    char path[SL_COMMAND_SIZE];
+    FILE* f = slMifPath(file, path, sizeof path) ? moxOpenRegular(path) : nullptr;
     if (f == nullptr)
         return false;
     fclose(f);
@@ -252,7 +247,7 @@ void carryOver(SLHandle* h, uint32_t old, float installedVersion)
     for (int i = 1; ok && i < count; ++i) {
         float version = 0;
         CarryOverBand older;
-        if (SLGetComponentMIFVersion(h, before[i], &version) == 0 && !moxCarryOverBand(version, &older))
+        if (slInstalledMifVersionOf(h, before[i], &version) == 0 && !moxCarryOverBand(version, &older))
             ok = SLCiUninstallData(h, before[i]) == 0;
     }
     if (!ok) {
@@ -602,6 +597,11 @@ int catalogueInstalledMifs(SLHandle* h)
     componentList = entry;
     findSupportedMifs(h);
     return 0;
+}
+
+const char* MoxComponentName(void)
+{
+    return moxComponentName;
 }
 
 void UnregisterWithSL(void)

@@ -97,6 +97,8 @@ void UnregisterWithSL(void);
 // and migrating nothing (for a process that only reads). 0, or -1 when the
 // own MIF is not installed.
 int catalogueInstalledMifs(SLHandle* h);
+// The own component's name, "Zorek Tessarin Server Manager - Mox".
+const char* MoxComponentName(void);
 // 0 when the own component exists afterwards and is catalogued, else -1.
 int findMOXmif(SLHandle* h);
 void findSupportedMifs(SLHandle* h);

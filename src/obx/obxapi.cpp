@@ -14,10 +14,11 @@ int hDevice1 = 0;
 uint32_t IpmiVersion = 0;
 uint32_t NTstatus[2] = {0, 0};
 uint32_t AsyncEventHandle = 0;
+const char* const obxDevicePath = "/dev/obx";
 
 namespace {
 
-const char* const devicePath = "/dev/obx";
+const char* const devicePath = obxDevicePath;
 
 int libcOpen(const char* path, int flags)
 {

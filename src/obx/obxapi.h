@@ -56,6 +56,8 @@ extern uint32_t IpmiVersion;
 extern uint32_t NTstatus[2];
 // 0 until a registration for asynchronous messages succeeds.
 extern uint32_t AsyncEventHandle;
+// The OBX device, "/dev/obx".
+extern const char* const obxDevicePath;
 
 // Third argument of every ioctl (40 bytes on i386).
 struct ObxIoctlRecord {

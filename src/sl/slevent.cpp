@@ -7,7 +7,10 @@
 #include <sched.h>
 
 #include "base/threadcheck.h"
+#include "sl/sl.h"
+#include "sl/slaccess.h"
 #include "sl/slhandle.h"
+#include "sl/slkey.h"
 
 namespace {
 
@@ -51,6 +54,91 @@ bool startEventThread(SLHandle* h)
         return false;
     }
     return true;
+}
+
+// Holds an indication of `length` bytes in `h` as the accessors read it: all
+// of it in the confirm buffer, its header also in the command block, no row
+// selected, and `origin` as the indication to complete.
+void holdIndication(SLHandle* h, const void* indication, uint32_t length, const void* origin)
+{
+    std::memcpy(h->command, indication, headerBytes);
+    storeWordAt(h->command, 13, 0);
+    storeWordAt(h->command, 14, 0);
+    storeWordAt(h->command, 15, pointerWord(origin));
+    if (indication != h->confirm)
+        std::memcpy(h->confirm, indication, length);
+    // Whatever reads past the indication's end finds zeros, not old heap.
+    std::memset(h->confirm + length, 0, h->confirmSize - length);
+}
+
+// Lays out an event indication in `out`, or with a null `out` only counts
+// it; the bytes it takes. Rows back to back, as under SL_LEVEL_CHECK, their
+// keys and values behind all of them; values 4-byte aligned.
+uint32_t layEventIndication(uint8_t* out, uint32_t component, const DmiString* const* classes,
+                            SLHandle* const* rows, uint32_t count)
+{
+    uint32_t used = 0;
+    auto word = [out](uint32_t at, uint32_t value) {
+        if (out != nullptr)
+            storeWord(out + at, value);
+    };
+    // The offset of a copy of `size` bytes at `from`; 0 (absent) for none.
+    auto copy = [out, &used](const void* from, uint64_t size) -> uint32_t {
+        if (from == nullptr || size == 0)
+            return 0;
+        uint32_t at = used;
+        used += static_cast<uint32_t>((size + 3) & ~3ull);
+        if (out != nullptr)
+            std::memcpy(out + at, from, size);
+        return at;
+    };
+    used = headerBytes;
+    word(0, SL_LEVEL_CHECK);
+    word(4, 1);
+    word(12, component);
+    word(48, headerBytes);
+    uint32_t data = used;
+    used += 4 + 16 * count;
+    word(data, count);
+    uint32_t rowAt = used;
+    for (uint32_t i = 0; i < count; ++i)
+        used += 16 + 16 * slRowAttributesPresent(rows[i]);
+    for (uint32_t i = 0; i < count; ++i) {
+        SLHandle* r = rows[i];
+        uint32_t entries = slRowAttributesPresent(r);
+        uint32_t entry = data + 4 + 16 * i;
+        word(entry, component);
+        word(entry + 4, copy(classes[i], 4ull + dmiStringLength(classes[i])));
+        word(entry + 8, 1);
+        word(entry + 12, rowAt);
+        word(rowAt, SLRowGroupId(r));
+        uint32_t keyCount = static_cast<uint32_t>(SLKeyCount(r));
+        const uint8_t* keys = slConfirmBytes(r, static_cast<uint32_t>(SLKeyListOffset(r)), 12ull * keyCount);
+        uint32_t keyList = keys != nullptr ? copy(keys, 12ull * keyCount) : 0;
+        word(rowAt + 4, keyList != 0 ? keyCount : 0);
+        word(rowAt + 8, keyList);
+        for (uint32_t k = 0; keyList != 0 && k < keyCount; ++k) {
+            uint32_t type = loadWordAt(keys + 12 * k, 1);
+            uint32_t offset = loadWordAt(keys + 12 * k, 2);
+            const uint8_t* length = slConfirmBytes(r, offset, 4);
+            uint64_t size = type == DMI_OCTETSTRING || type == DMI_DISPLAYSTRING
+                                ? (length != nullptr ? 4ull + loadWord(length) : 0)
+                                : SLAttributeSize(static_cast<int>(type), nullptr);
+            word(keyList + 12 * k + 8, copy(slConfirmBytes(r, offset, size), size));
+        }
+        word(rowAt + 12, entries);
+        for (uint32_t a = 0; a < entries; ++a) {
+            uint32_t at = rowAt + 16 + 16 * a;
+            uint32_t type = SLRowAttributeType(r, a);
+            const void* value = SLRowAttributePtr(r, a);
+            word(at + 4, SLRowAttributeId(r, a));
+            word(at + 8, type);
+            word(at + 12, copy(value, value != nullptr ? SLAttributeSize(static_cast<int>(type), value) : 0));
+        }
+        rowAt += 16 + 16 * entries;
+    }
+    word(8, used);
+    return used;
 }
 
 } // namespace
@@ -108,13 +196,7 @@ void SLIndicationFunc(void* indication)
     bool sane = length >= headerBytes && length <= maxIndicationSize;
     SLHandle* h = sane && userHandler.load() != nullptr ? SLCreateHandle(length) : nullptr;
     if (h != nullptr && userHandler.load() != nullptr) {
-        std::memcpy(h->command, indication, headerBytes);
-        storeWordAt(h->command, 13, 0);
-        storeWordAt(h->command, 14, 0);
-        storeWordAt(h->command, 15, pointerWord(indication));
-        std::memcpy(h->confirm, indication, length);
-        // Whatever reads past the indication's end finds zeros, not old heap.
-        std::memset(h->confirm + length, 0, h->confirmSize - length);
+        holdIndication(h, indication, length, indication);
         if (startEventThread(h)) {
             --callsInside;
             return; // now in the event thread's care
@@ -145,3 +227,16 @@ void* SLEventThread(void* handle)
 }
 
 } // extern "C"
+
+SLHandle* slMakeEventIndication(uint32_t component, const DmiString* const* classes, SLHandle* const* rows,
+                                uint32_t count)
+{
+    uint32_t length = layEventIndication(nullptr, component, classes, rows, count);
+    SLHandle* h = SLCreateHandle(length);
+    if (h == nullptr)
+        return nullptr;
+    std::memset(h->confirm, 0, h->confirmSize);
+    layEventIndication(h->confirm, component, classes, rows, count);
+    holdIndication(h, h->confirm, length, nullptr);
+    return h;
+}

@@ -25,3 +25,12 @@ void* SLEventThread(void* handle);
 void slEventQuiesce(void);
 }
 
+// An event indication (type 1) of `component` made of rows read from the
+// provider, for a process that explains an event instead of receiving it:
+// class i is named by the DMI string `classes[i]` and carries the row that the
+// row command's confirm in `rows[i]` holds, with its keys and values. Laid out
+// as the provider delivers one and held as SLIndicationFunc holds a delivered
+// one, so the worker and the matchers read it alike. A new handle (the caller
+// destroys it), or null when memory runs out.
+SLHandle* slMakeEventIndication(uint32_t component, const DmiString* const* classes, SLHandle* const* rows,
+                                uint32_t count);

@@ -165,14 +165,10 @@ int SLInstallMIF(SLHandle* h, const char* file)
 {
     if (h == nullptr || file == nullptr)
         return 1;
-    const char* directory = std::getenv("UXDMIPATH");
-    if (directory == nullptr)
-        directory = defaultMifDirectory;
     // The path travels in the command block after its 84 bytes of header and
     // parameters, with its terminator; a longer one is refused there.
     char path[SL_COMMAND_SIZE - 84];
-    int length = std::snprintf(path, sizeof path, "%s/%s", directory, file);
-    if (length < 0 || static_cast<size_t>(length) >= sizeof path)
+    if (!slMifPath(file, path, sizeof path))
         return 1;
     return SLCiInstallData(h, 0, path);
 }
@@ -181,16 +177,25 @@ int SLGetInstalledMIFVersion(SLHandle* h, const char* name, float* version)
 {
     if (h == nullptr || name == nullptr)
         return 1;
-    return SLGetComponentMIFVersion(h, SLMapComponentNameToId(name), version);
+    return slInstalledMifVersionOf(h, SLMapComponentNameToId(name), version);
 }
 
-int SLGetComponentMIFVersion(SLHandle* h, uint32_t c, float* version)
+} // extern "C"
+
+bool slMifPath(const char* file, char* out, size_t size)
 {
-    if (h == nullptr)
-        return 1;
+    const char* directory = std::getenv("UXDMIPATH");
+    if (directory == nullptr)
+        directory = defaultMifDirectory;
+    int length = std::snprintf(out, size, "%s/%s", directory, file);
+    return length >= 0 && static_cast<size_t>(length) < size;
+}
+
+int slInstalledMifVersionOf(SLHandle* h, uint32_t c, float* version)
+{
     uint32_t g = SLMapClassNameToId(c, componentIdClass);
     uint32_t a = SLMapAttributeNameToId(c, g, versionAttribute);
-    if (c == 0 || g == 0 || a == 0)
+    if (h == nullptr || c == 0 || g == 0 || a == 0)
         return 1;
     if (SLGetAttribute(h, c, g, a, nullptr) != 0)
         return 1;
@@ -206,5 +211,3 @@ int SLGetComponentMIFVersion(SLHandle* h, uint32_t c, float* version)
     SLDeleteString(text);
     return 0;
 }
-
-} // extern "C"

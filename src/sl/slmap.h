@@ -2,6 +2,8 @@
 // installation.
 #pragma once
 
+#include <cstddef>
+
 #include "sl/sltypes.h"
 
 extern "C" {
@@ -18,6 +20,11 @@ int PrefixMatches(const DmiString* d, const char* s);
 // Installs `file` from the MIF directory ("UXDMIPATH", else "/var/dmi/mifs/backup").
 int SLInstallMIF(SLHandle* h, const char* file);
 int SLGetInstalledMIFVersion(SLHandle* h, const char* name, float* version);
-// The same for the component with id `component` (0: none).
-int SLGetComponentMIFVersion(SLHandle* h, uint32_t component, float* version);
 }
+
+// The path SLInstallMIF gives the provider for `file`, in `out`; false when it
+// does not fit.
+bool slMifPath(const char* file, char* out, size_t size);
+// The installed version of component `c`'s MIF, read as SLGetInstalledMIFVersion
+// reads it for a component found by name: 0, or 1 when it cannot be read.
+int slInstalledMifVersionOf(SLHandle* h, uint32_t c, float* version);

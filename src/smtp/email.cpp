@@ -85,6 +85,28 @@ int emailReadSettings(SLHandle* handle, const char* hostName, EmailConfig* confi
     return 1;
 }
 
+int emailCompose(SLHandle* handle, const char* hostName, EventRecord* record, EmailConfig* config)
+{
+    if (emailReadSettings(handle, hostName, config) == 0)
+        return 0;
+    char group[512];
+    safeText(record->groupName, "Unknown", group, sizeof group);
+    snprintf(config->subject, EMAIL_SUBJECT_SIZE, "%s:%s", "Zorek Server Management Alert", hostName);
+    snprintf(config->body, EMAIL_BODY_SIZE, "Check %s at server %s\n", group, hostName);
+    appendLine(config->body, "Event Type:%s\n", record->eventTypeText, "Unknown");
+    appendLine(config->body, "Event Severity:%s\n", record->severityText, "Unknown");
+    appendLine(config->body, "Component:%s\n", record->componentName, "Unknown");
+    appendLine(config->body, "Group:%s\n", record->groupName, "Unknown");
+    if (record->keyList != nullptr) {
+        char label[64];
+        rowLabel(handle, record, label, sizeof label);
+        appendLine(config->body, "Instance:%s\n", label, "Unknown");
+    } else {
+        appendLine(config->body, "Instance:%s\n", nullptr, "Unknown");
+    }
+    return 1;
+}
+
 int MoxSendEmail(SLHandle*, EventRecord* record)
 {
     pEmailConfig = static_cast<EmailConfig*>(calloc(1, sizeof(EmailConfig)));
@@ -101,46 +123,41 @@ int MoxSendEmail(SLHandle*, EventRecord* record)
             return 0;
         }
     }
-    EmailConfig* config = pEmailConfig;
-
-    char group[512];
-    safeText(record->groupName, "Unknown", group, sizeof group);
     char hostName[MOX_HOST_NAME_SIZE];
     if (moxHostName(hostName) != 0) {
         moxLog(LOG_INFO, "%s", "gethostname failed...exiting\n");
         releaseConfig(handle);
         return 0;
     }
-    char firstLine[1024];
-    snprintf(firstLine, sizeof firstLine, "Check %s at server %s", group, hostName);
-
     handle = SLCreateHandle(0);
     if (handle == nullptr) {
         moxLog(LOG_INFO, "%s", "Unable to create SL handle...exiting\n");
         releaseConfig(handle);
         return 0;
     }
-    if (emailReadSettings(handle, hostName, config) == 0) {
-        actionLogNoServer(record);
-        releaseConfig(handle); // no server configured: no e-mail
-        return 0;
-    }
-
-    snprintf(config->subject, EMAIL_SUBJECT_SIZE, "%s:%s", "Zorek Server Management Alert", hostName);
-    copyCut(config->body, EMAIL_BODY_SIZE, firstLine);
-    copyCut(config->body + strlen(config->body), EMAIL_BODY_SIZE - strlen(config->body), "\n");
-    appendLine(config->body, "Event Type:%s\n", record->eventTypeText, "Unknown");
-    appendLine(config->body, "Event Severity:%s\n", record->severityText, "Unknown");
-    appendLine(config->body, "Component:%s\n", record->componentName, "Unknown");
-    appendLine(config->body, "Group:%s\n", record->groupName, "Unknown");
-    if (record->keyList != nullptr) {
-        char label[64];
-        rowLabel(handle, record, label, sizeof label);
-        appendLine(config->body, "Instance:%s\n", label, "Unknown");
-    } else {
-        appendLine(config->body, "Instance:%s\n", nullptr, "Unknown");
-    }
-    actionLogSendEmail(config, record);
+    if (emailCompose(handle, hostName, record, pEmailConfig) == 0)
+        actionLogNoServer(record); // no server configured: no e-mail
+    else
+        actionLogSendEmail(pEmailConfig, record);
     releaseConfig(handle);
     return 0;
+}
+
+void describeMoxSendEmail(SLHandle*, EventRecord* record, const Explanation* explain)
+{
+    char hostName[MOX_HOST_NAME_SIZE];
+    SLHandle* handle = moxHostName(hostName) == 0 ? SLCreateHandle(0) : nullptr;
+    if (handle == nullptr) {
+        explainLine(explain, "no e-mail: the host name or a working handle cannot be had");
+        return;
+    }
+    char server[EMAIL_SERVER_SIZE] = {}, sender[EMAIL_SENDER_SIZE] = {}, recipients[EMAIL_RECIPIENTS_SIZE] = {};
+    char subject[EMAIL_SUBJECT_SIZE] = {}, body[EMAIL_BODY_SIZE] = {};
+    EmailConfig config{server, sender, recipients, subject, body};
+    if (emailCompose(handle, hostName, record, &config) == 0)
+        explainLine(explain, "no e-mail: no SMTP server is set (baseboard group 1012, attribute 1)");
+    else
+        explainLine(explain, "e-mail through server %s port 25 from %s to %s, subject \"%s\"", server, sender,
+                    recipients, subject);
+    SLDestroyHandle(handle);
 }

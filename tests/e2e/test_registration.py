@@ -109,6 +109,13 @@ class RegistrationTest(BedTestCase):
                 changed = (tuple([first[k] for k in key_ids] + added_keys), 7)
                 self.assertEqual(expected[changed], "7", version)
 
+                # What a start would carry over, told by mox --check before it
+                # (warnings only: the old tables are replaced).
+                check = bed.run([require("MOX_BIN", "the mox daemon"), "--check"])
+                self.assertIn("warning own MIF installed: component %d, version %g; a start installs the new mox.mif "
+                              "and carries actions table group %d over into group %d\n"
+                              % (old_id, float(version), old_group, new_group), check.stdout.decode())
+                self.assertEqual(check.returncode, 0, check.stdout)
                 mox = bed.start_mox()
                 new_id = wait_until(lambda: self.current_mox(bed), 15)
                 self.assertTrue(new_id, "%s: mox.mif 2.93 never appeared; %s" % (version, mox.stderr.data))

@@ -23,7 +23,7 @@ for fact in /usr/local/ubo/bin/mox.cfg notificationonly /var/dmi/mifs/backup/mox
     /var/run/kobLock /dev/kob /dev/obx UXDMIPATH "group 1012" "Group 10" "Group 4" \
     "mox: initialization failed, return code = 0x" "Mox has been disabled." \
     "mount -t msdos /dev/fd0 /mnt/floppy" SIGTERM SIGINT SIGQUIT SIGPWR SIGHUP \
-    --version --help --test-email actionlog Type=notify READY=1 "journalctl -u mox" "dmictl(8)"; do
+    --version --help --test-email --check --explain actionlog Type=notify READY=1 "journalctl -u mox" "dmictl(8)"; do
     grep -qF -- "$fact" <<<"$text" || fail "does not mention $fact"
 done
 
@@ -37,12 +37,13 @@ page_order=$(sed -n '/^MARKER FILES/,/^CONFIGURATION/p' <<<"$text" |
 status=$(sed -n '/^EXIT STATUS/,/^ENVIRONMENT/p' <<<"$text")
 for code in 1 2 3; do grep -qE "^ +$code +[a-z]" <<<"$status" || fail "exit code 0x$code not explained"; done
 
-# The table of action codes: the daemon's code-to-handler pairs, in the
-# daemon's run order.
+# The table of action codes: the daemon's code-to-handler pairs (whose name,
+# as --explain shows it, is the handler's), in the daemon's run order.
 actions=$source/src/actions/actions.cpp
 declare -A handler
 while read -r code name; do handler[$code]=$name; done < <(
-    sed -n '/^const ActionEntry lscActions\[\]/,/^};/p' "$actions" | sed -n 's/.*{\([0-9]*\), \([A-Za-z]*\)}.*/\1 \2/p')
+    sed -n '/^const ActionEntry lscActions\[\]/,/^};/p' "$actions" |
+        sed -n 's/.*{\([0-9]*\), \([A-Za-z]*\), .*, "\2"}.*/\1 \2/p')
 run_order=$(sed -n '/^const ActionOrder ActionID\[\]/,/^};/p' "$actions" | grep -oE '\{[0-9]+,' | tr -d '{,' | grep -vx 0)
 [ "$(wc -w <<<"$run_order")" -eq 15 ] || fail "could not read the daemon's run order"
 expected=$(for code in $run_order; do echo "$code ${handler[$code]}"; done)

@@ -12,6 +12,7 @@
 
 #include "base/sleep.h"
 #include "dmisp/dmisp.h"
+#include "actions/actions.h"
 #include "sl/sl.h"
 #include "sl/slaccess.h"
 #include "sl/slevent.h"
@@ -351,10 +352,35 @@ const char board[] = R"(start component name = "Test Board"
     start attribute name = "Label" id = 2 type = displaystring(16) end attribute
   end group
   start table name = "Voltage Probe" class = "DMTF|Voltage Probe|001" id = 30 {1, "CPU"} {2, "Memory"} end table
+  start group name = "Slot" class = "DMTF|Slot|001" key = 1
+    start attribute name = "Name" id = 1 type = displaystring(8) end attribute
+    start attribute name = "Width" id = 2 type = integer end attribute
+  end group
+  start table name = "Slot" class = "DMTF|Slot|001" id = 31 {"A1", 16} end table
 end component)";
 
 std::string str(uint32_t n) { return std::to_string(static_cast<int32_t>(n)) + " "; }
-std::string seen;
+std::string seen, delivered;
+
+// Everything the accessors read of an event indication: classes, rows, keys, values.
+std::string readEvent(SLHandle* e)
+{
+    std::string out = str(SLIndicationType(e)) + str(SLIndicationComponentId(e));
+    for (uint32_t c = 0; c < SLEventClassCount(e); ++c) {
+        SLEventSelectRowCnf(e, c, 0);
+        SLKeyList* keys = SLCreateKeyList(e);
+        char keyText[200];
+        explainKeys(keys, keyText, sizeof keyText), SLDeleteKeyList(keys);
+        out += "| " + text(SLEventClassString(e, c)) + " " + str(SLEventComponentId(e, c)) +
+               str(SLEventRowCount(e, c)) + str(SLRowGroupId(e)) + keyText;
+        for (uint32_t a = 0; a < SLRowAttributeCount(e); ++a) {
+            auto* v = static_cast<const char*>(SLRowAttributePtr(e, a));
+            unsigned size = SLAttributeSize(static_cast<int>(SLRowAttributeType(e, a)), v);
+            out += " " + str(SLRowAttributeId(e, a)) + str(SLRowAttributeType(e, a)) + std::string(v, v ? size : 0);
+        }
+    }
+    return out;
+}
 
 
 TEST(ProviderContract, ConfirmsAndIndicationsReadThroughTheAccessors)
@@ -367,7 +393,7 @@ TEST(ProviderContract, ConfirmsAndIndicationsReadThroughTheAccessors)
         SLEventSelectRowCnf(e, 1, 0);
         if (SLIndicationType(e) == 1)
             seen = str(SLEventClassCount(e)) + str(SLKeyCount(e)) + str(SLRowGroupId(e)) + text(SLRowStringPtr(e, 1)) +
-                " " + text(SLEventClassString(e, 0));
+                " " + text(SLEventClassString(e, 0)), delivered = readEvent(e);
         return 0; }), 0);
     uint32_t c = dmisp::installText(board, "board.mif");
     SLKeyList* keys = nullptr;
@@ -391,6 +417,15 @@ TEST(ProviderContract, ConfirmsAndIndicationsReadThroughTheAccessors)
         ASSERT_TRUE(dmisp::raiseEvent(c, {20, {}}, {30, {"2"}}) == 0 && dmisp::waitIndicationsCompleted());
         EXPECT_EQ(seen, "2 1 30 Memory EventGeneration|Voltage Probe|001") << "level check " << level;
     }
+    // The indication an explanation makes of rows read (a string key here)
+    // reads like the one the provider delivers for them.
+    ASSERT_TRUE(dmisp::raiseEvent(c, {20, {}}, {31, {"A1"}}) == 0 && dmisp::waitIndicationsCompleted());
+    SLHandle* read[] = {SLCreateHandle(0), SLCreateHandle(0)};
+    ASSERT_EQ(SLGetRow(read[0], c, 20, 0, nullptr) + SLGetFirstRow(read[1], c, 31, 0, nullptr), 0);
+    const DmiString* classes[] = {NewDmiString("EventGeneration|Voltage Probe|001"), NewDmiString("DMTF|Slot|001")};
+    SLHandle* made = slMakeEventIndication(c, classes, read, 2);
+    EXPECT_EQ(readEvent(made), delivered);
+    EXPECT_NE(delivered.find("1=\"A1\""), std::string::npos) << delivered;
     SLDmiUnregisterMgmt(h), dmisp::shutdown(), SLCleanup();
     EXPECT_EQ(std::system(("rm -rf " + std::string(dir)).c_str()), 0);
 }
