@@ -312,6 +312,16 @@ int statusResult(uint32_t status, std::string* out)
     return status == StatusStorageFailed ? 3 : 1;
 }
 
+// A change the database could not store is a failure with its cause.
+int changeResult(uint32_t status, const std::string& what, const std::string& error, std::string* out)
+{
+    if (status == StatusStorageFailed && !error.empty()) {
+        *out += what + ": " + error + "\n";
+        return 1;
+    }
+    return statusResult(status, out);
+}
+
 const char* typeName(uint32_t t)
 {
     switch (t) {
@@ -432,11 +442,7 @@ int runControl(const std::vector<std::string>& words, std::string* out)
         if (cmd == "uninstall") {
             std::string error;
             uint32_t status = uninstall(c, &error);
-            if (status == StatusStorageFailed && !error.empty()) {
-                *out += "cannot remove component " + std::to_string(c) + ": " + error + "\n";
-                return 1;
-            }
-            return statusResult(status, out);
+            return changeResult(status, "cannot remove component " + std::to_string(c), error, out);
         }
         return statusResult(raiseInstallEvent(c, cmd == "install-event"), out);
     }
@@ -476,8 +482,9 @@ int runControl(const std::vector<std::string>& words, std::string* out)
         std::vector<std::string> keys = keyArgs(a);
         if (a.more())
             return usage();
+        std::string error;
         if (cmd == "set")
-            return statusResult(setValue(c, g, at, keys, value), out);
+            return changeResult(setValue(c, g, at, keys, value, &error), "cannot set the value", error, out);
         uint32_t status = getValue(c, g, at, keys, &value);
         if (status == StatusOk)
             *out += value + "\n";

@@ -118,9 +118,10 @@ std::vector<std::vector<std::string>> rows(uint32_t component, uint32_t group);
 uint32_t getValue(uint32_t component, uint32_t group, uint32_t attribute, const std::vector<std::string>& keys,
                   std::string* value);
 // Writes one value (access is not checked here: this is the instrumentation's
-// side); persisted before it returns. A Status.
+// side); persisted before it returns. A Status; StatusStorageFailed with
+// *error when the file cannot be written (the value is left as it was).
 uint32_t setValue(uint32_t component, uint32_t group, uint32_t attribute, const std::vector<std::string>& keys,
-                  const std::string& value);
+                  const std::string& value, std::string* error = nullptr);
 // The MIF text the database file of a component holds ("" when absent).
 std::string componentMif(uint32_t component);
 

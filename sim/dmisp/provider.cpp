@@ -837,7 +837,7 @@ uint32_t getValue(uint32_t component, uint32_t group, uint32_t attribute, const 
 }
 
 uint32_t setValue(uint32_t component, uint32_t group, uint32_t attribute, const std::vector<std::string>& keys,
-                  const std::string& text)
+                  const std::string& text, std::string* failure)
 {
     if (!ensureOpen())
         return StatusStorageFailed;
@@ -869,7 +869,8 @@ uint32_t setValue(uint32_t component, uint32_t group, uint32_t attribute, const 
     }
     std::string error;
     if (!s.db.persist(component, &error)) {
-        std::fprintf(stderr, "dmisp: cannot write %s\n", error.c_str());
+        if (failure != nullptr)
+            *failure = error;
         current = old;
         a.value = oldTemplate;
         g->reindex();

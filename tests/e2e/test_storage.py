@@ -146,13 +146,16 @@ class StorageTest(EventBedCase):
             self.assertEqual(os.stat(fresh).st_mode & 0o777, 0o700)
             done = bed.run(USER + [dmictl, "--db", fresh, "list"])
             self.assertEqual((done.returncode, done.stderr.decode()), (3, "dmictl: %s: permission denied\n" % fresh))
-            # A failed removal is an error with its cause, and the component stays.
+            # A change that cannot be stored is an error with its cause, and nothing changes.
             board = bed.dmictl("install", os.path.join(bed.paths["mifs"], "baseboard.mif")).strip()
-            done = bed.run([dmictl, "uninstall", board], {"DMISP_STORAGE_FAULT": "fail:1"})
-            self.assertEqual((done.returncode, done.stderr.decode()),
-                             (1, "cannot remove component %s: %s/component-%s.mif: read-only file system\n"
-                              % (board, db, board)))
-            self.assertIn(board + "\t", bed.dmictl("list"))
+            before = bed.dmictl("mif", board)
+            for command, failure in ((["set", board, 1012, 1, "x"], "cannot set the value: %s: no space left on device"),
+                                     (["uninstall", board], "cannot remove component %s: %%s: read-only file system"
+                                      % board)):
+                done = bed.run([dmictl] + [str(a) for a in command], {"DMISP_STORAGE_FAULT": "fail:1"})
+                path = "%s/component-%s.mif" % (db, board)
+                self.assertEqual((done.returncode, done.stderr.decode()), (1, failure % path + "\n"))
+                self.assertEqual(bed.dmictl("mif", board), before)
 
         run_in_parallel([deadline, access])
         ids = {"baseboard": bed.component_id(BOARD)}
