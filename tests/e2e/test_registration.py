@@ -117,7 +117,9 @@ class RegistrationTest(BedTestCase):
                               % (old_id, float(version), old_group, new_group), check.stdout.decode())
                 self.assertEqual(check.returncode, 0, check.stdout)
                 mox = bed.start_mox()
-                new_id = wait_until(lambda: self.current_mox(bed), 15)
+                # The old MIF goes last, once the new one holds every value.
+                self.assertTrue(bed.wait_registered(60), "%s: %s" % (version, mox.stderr.data))
+                new_id = self.current_mox(bed)
                 self.assertTrue(new_id, "%s: mox.mif 2.93 never appeared; %s" % (version, mox.stderr.data))
                 self.assertNotEqual(new_id, old_id, version)
                 self.assertEqual(len(bed.dmictl("list").splitlines()), 1, version)
@@ -129,8 +131,6 @@ class RegistrationTest(BedTestCase):
                     new = {(tuple(row[k] for k in new_key_ids), a): row.get(a)
                            for row in bed.table(new_id, new_group) for a in SWITCHES}
                     return {key: new[key] for key in expected if key in new}
-                # The write-back follows the reinstall; let it finish.
-                wait_until(lambda: carried() == {k: expected[k] for k in carried()}, 10)
                 got = carried()
                 self.assertIn(changed, got, version)
                 if old_group == 3:
