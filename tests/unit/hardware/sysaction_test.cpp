@@ -66,6 +66,22 @@ TEST_F(SystemControl, WatchdogCountdown)
         std::vector<ObxSimRequest> sets = requestsFor(0x06, 0x24);
         EXPECT_EQ(sets.empty() ? std::vector<uint8_t>{} : sets[0].data, row.data) << row.ms;
     }
+    // Mode 1 first arms no action with one step, then restarts; a refused first request ends it.
+    for (bool refused : {false, true}) {
+        SetUp();
+        if (refused)
+            obxsimInjectFault(ObxIoctlSendMessage, 0x06, 0x24, ObxSimCompletionCode, 0xC0);
+        EXPECT_EQ(MoxResetWatchDogTimer(1), refused ? ObxResultError : ObxResultOk);
+        EXPECT_EQ(requestsFor(0x06, 0x24).at(0).data, (std::vector<uint8_t>{0x04, 0x00, 0x00, 0x00, 0x01, 0x00}));
+        EXPECT_EQ(requestsFor(0x06, 0x22).size(), refused ? 0u : 1u);
+    }
+    // The capability report asks the controller nothing.
+    SetUp();
+    SystemControlInfo info{};
+    EXPECT_EQ(MoxGetSystemControlInfo(&info), 0);
+    EXPECT_EQ((std::vector<uint32_t>{info.capabilities, info.minimumDelay, info.maximumDelay}),
+              (std::vector<uint32_t>{0x7FF, 100, 6553600}));
+    EXPECT_TRUE(obxsimLog().empty());
 }
 
 } // namespace
