@@ -104,11 +104,14 @@ void raise(bool panel)
     }
 }
 
-// Waits until `done` holds; an event that never comes ends the run.
+// Waits until `done` holds; a minute without a handled event ends the run.
 template <typename Done>
 void waitFor(Done done, const char* what)
 {
+    unsigned handled = EventsHandled();
     for (auto until = Clock::now() + std::chrono::seconds(60); !done();) {
+        if (EventsHandled() != handled)
+            handled = EventsHandled(), until = Clock::now() + std::chrono::seconds(60);
         if (Clock::now() > until) {
             std::fprintf(stderr, "no progress for a minute: %s (%u events handled)\n", what, EventsHandled());
             std::exit(1);
