@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 
+#include <chrono>
 #include <fstream>
 #include <sys/wait.h>
 #include <syslog.h>
@@ -136,6 +137,9 @@ TEST(OsServices, DelaySleepsWholeSecondsAtLeastOne)
         MoxDelay(ms);
     moxSetSleepHook(nullptr);
     EXPECT_EQ(sleeps, (std::vector<unsigned>{3000, 2000, 1000, 1000, 1000, 40000}));
+    const auto start = std::chrono::steady_clock::now(); // a real sleep keeps its sub-second part
+    moxSleepMs(50);
+    EXPECT_GE(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(50));
 }
 
 TEST(OsServices, ShutdownExecutesInitZeroWithNoBlockedSignals)
