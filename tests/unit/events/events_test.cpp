@@ -117,7 +117,7 @@ TEST_F(Events, StandardAndVendorRowSelectionAndRowsClaimingTooManyAttributes)
         SLDmiInvoke = error >= 0 ? SLInvokeFunction(DmiInvoke) : [](void* b) -> uint32_t { // group listings refused
             return loadWordAt(b, 1) == 516 ? 1 : DmiInvoke(b);
         };
-        dmisp::setValue(component[1], 30, 1, {}, std::to_string(error < 0 ? 2 : error));
+        ASSERT_EQ(dmisp::setValue(component[1], 30, 1, {}, std::to_string(error < 0 ? 2 : error)), 0u);
         lines(), raise(1, 1);
         std::vector<int> priorities;
         for (const auto& line : lines())
