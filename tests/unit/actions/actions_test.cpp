@@ -123,7 +123,8 @@ TEST(OsServices, NotificationOnlyRule)
         std::ofstream(path) << row.content;
         bNotificationOnly = row.before, bActionLog = 0;
         EXPECT_EQ(processCfgFile(path.c_str()), 1);
-        EXPECT_EQ(std::make_pair(bNotificationOnly, bActionLog), std::make_pair(row.after, row.actionLog)) << row.content;
+        EXPECT_EQ(std::make_pair(bNotificationOnly, bActionLog), std::make_pair(row.after, row.actionLog))
+            << row.content;
     }
     unlink(path.c_str());
     EXPECT_EQ(processCfgFile(path.c_str()), 0);

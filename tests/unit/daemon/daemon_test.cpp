@@ -24,8 +24,10 @@ SLHandle* indication(uint32_t type, const std::string& cls, const std::string& s
     storeWordAt(h->command, 12, 64); // where the data starts: class count; component, string, rows
     storeWordAt(h->confirm + 64, 0, cls.empty() ? 0u : second.empty() ? 1u : 2u), storeWordAt(h->confirm + 64, 1, 5);
     storeWordAt(h->confirm + 64, 2, 1024), storeWordAt(h->confirm + 64, 3, 0), storeWordAt(h->confirm + 64, 6, 1536);
-    for (auto [at, text] : {std::pair{1024, cls}, {1536, second}})
-        storeWord(h->confirm + at, static_cast<uint32_t>(text.size())), std::memcpy(h->confirm + at + 4, text.data(), text.size());
+    for (auto [at, text] : {std::pair{1024, cls}, {1536, second}}) {
+        storeWord(h->confirm + at, static_cast<uint32_t>(text.size()));
+        std::memcpy(h->confirm + at + 4, text.data(), text.size());
+    }
     return h;
 }
 

@@ -113,7 +113,8 @@ TEST_F(Events, StandardAndVendorRowSelectionAndRowsClaimingTooManyAttributes)
     v.vendor = {vendorRow(anyBoth, {9, 16})};
     start(v);
     actionsSetHandlers(nullptr);
-    for (auto [error, priority] : {std::pair{0, LOG_INFO}, {1, LOG_WARNING}, {2, LOG_ERR}, {3, LOG_ERR}, {-1, LOG_ERR}}) {
+    for (auto [error, priority] :
+         {std::pair{0, LOG_INFO}, {1, LOG_WARNING}, {2, LOG_ERR}, {3, LOG_ERR}, {-1, LOG_ERR}}) {
         SLDmiInvoke = error >= 0 ? SLInvokeFunction(DmiInvoke) : [](void* b) -> uint32_t { // group listings refused
             return loadWordAt(b, 1) == 516 ? 1 : DmiInvoke(b);
         };

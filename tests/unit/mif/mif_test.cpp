@@ -64,8 +64,9 @@ TEST_F(Provider, CatalogueValuesRowNamesAndActionRows)
         if (++commandsSent, loadWordAt(block, 1) != 520 || loadWordAt(block, 18) != 99)
             return DmiInvoke(block);
         const uint32_t words[] = {99, 44, 1, 5, 4, 2, 28, 1, 53, 1, 62}; // attribute 99, two entries at 28
-        memcpy(wordPointer(loadWordAt(block, 8)), words, sizeof words);
-        memcpy(static_cast<uint8_t*>(wordPointer(loadWordAt(block, 8))) + 44, "\5\0\0\0Twice\5\0\0\0First\6\0\0\0Second", 28);
+        auto* confirm = static_cast<uint8_t*>(wordPointer(loadWordAt(block, 8)));
+        memcpy(confirm, words, sizeof words);
+        memcpy(confirm + 44, "\5\0\0\0Twice\5\0\0\0First\6\0\0\0Second", 28); // name and texts
         storeWordAt(block, 10, 1), storeWordAt(block, 11, 0);
         return dmiConfirmFunc(block), 0;
     };
@@ -163,7 +164,8 @@ TEST_F(Provider, CarryOverBandsFailuresAndKeylessRows)
     ownMifFile(ownMifWith("2.93", "new", {}, {}));
     const Texts fresh{"0", "0", "1", "new"};
     struct Row { const char* version; Texts vendor, standard; } rows[] = {
-        {"2.50", {"1", "0", "0", "new"}, fresh}, {"2.51", {"0", "1", "0", "new"}, fresh}, {"2.91", fresh, {"1", "1", "0", "new"}},
+        {"2.50", {"1", "0", "0", "new"}, fresh}, {"2.51", {"0", "1", "0", "new"}, fresh},
+        {"2.91", fresh, {"1", "1", "0", "new"}},
         {"2.92", fresh, {"1", "1", "0", "new"}}, {"none", {"1", "0", "0", "new"}, fresh}}; // no digits: read as 0
     for (const auto& r : rows) {
         SCOPED_TRACE(r.version);

@@ -67,7 +67,8 @@ TEST_F(Obx, ControllerClassAndDriverFaults)
     obxsimSetDeviceMissing(true);
     testing::internal::CaptureStderr();
     EXPECT_EQ(open_obx(), 0);
-    EXPECT_EQ(testing::internal::GetCapturedStderr(), "obxapi open_obx: open(/dev/obx) failed\n: No such file or directory\n");
+    EXPECT_EQ(testing::internal::GetCapturedStderr(),
+              "obxapi open_obx: open(/dev/obx) failed\n: No such file or directory\n");
     SetUp();
     obxsimInjectFault(ObxIoctlSendMessage, 0x06, 0x01, ObxSimCompletionCode, 0xC1, 1);
     testing::internal::CaptureStdout();

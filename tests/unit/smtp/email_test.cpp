@@ -45,7 +45,8 @@ TEST_F(Provider, FromTheBaseboardSettingsAsTheServerReceivesIt)
     smtpSetPort(defaults.port());
     MoxSendEmail(nullptr, &record);
     const std::string admin = "admin@" + std::string(host);
-    EXPECT_NE(defaults.received().find("MAIL FROM:<" + admin + ">\r\nRCPT TO:<" + admin + ">\r\nDATA"), std::string::npos);
+    EXPECT_NE(defaults.received().find("MAIL FROM:<" + admin + ">\r\nRCPT TO:<" + admin + ">\r\nDATA"),
+              std::string::npos);
     // Without a server address nothing is sent or logged.
     dmisp::setValue(board, 1012, 1, {}, "");
     smtpSetPort(1);

@@ -48,7 +48,8 @@ TEST(Smtp, DialogueStagesAndFailureLines)
          "", 1000, "a@x\r\nRSET", "b@y, c@z;;d@w", "s\nt", "one\n.two\r\nthr\x01" "ee"},
         {"greeting", upTo(0, "421 busy\r\n"), sent(0), failed(5, 421)}, {"HELO", upTo(1, "500 no\r\n"), sent(1), failed(8, 500)},
         // Silence keeps the previous code: 0 before the greeting, 220 after HELO.
-        {"empty greeting", upTo(0, ""), sent(0), failed(5, 0)}, {"silent after HELO", upTo(1, ""), sent(1), failed(8, 220)},
+        {"empty greeting", upTo(0, ""), sent(0), failed(5, 0)},
+        {"silent after HELO", upTo(1, ""), sent(1), failed(8, 220)},
         {"server by host name", upTo(1, "500 no\r\n"), "HELO localhost\r\n", failed(8, 500, "localhost"), 1000, "a@x",
          "b@y", "s", "b\n", "localhost"},
         {"host name not found", {}, "", socketsLine + notFound + ",Reason:Mox email alert was not sent Server name:[" +
@@ -73,7 +74,8 @@ TEST(Smtp, DialogueStagesAndFailureLines)
             peer.emplace(row.script);
         smtpSetPort(peer ? peer->port() : 1);
         writable = row.writable;
-        EmailConfig config{row.server.data(), row.sender.data(), row.recipients.data(), row.subject.data(), row.body.data()};
+        EmailConfig config{row.server.data(), row.sender.data(), row.recipients.data(), row.subject.data(),
+                           row.body.data()};
         testing::internal::CaptureStderr();
         EXPECT_EQ(_MoxSendEmail(&config), row.log.empty() ? 1 : 0);
         std::string err = testing::internal::GetCapturedStderr();
