@@ -2,7 +2,7 @@
 // (DmiInvoke to the confirm callback) and a get-row by keys on tables of
 // growing size. Prints a table of medians and 99th percentiles.
 //
-//   dmisp_bench [iterations]
+//   dmisp_bench [iterations (20000)] [largest table (10000 rows)]
 #include <algorithm>
 #include <atomic>
 #include <chrono>
@@ -85,7 +85,8 @@ Figures summarise(std::vector<double>& us)
 
 int main(int argc, char** argv)
 {
-    unsigned iterations = argc > 1 ? static_cast<unsigned>(std::atoi(argv[1])) : 20000;
+    unsigned iterations = std::max(1, argc > 1 ? std::atoi(argv[1]) : 20000);
+    unsigned largest = argc > 2 ? static_cast<unsigned>(std::atoi(argv[2])) : 10000;
     char dir[] = "/tmp/dmisp-bench-XXXXXX";
     if (mkdtemp(dir) == nullptr)
         return 1;
@@ -104,6 +105,8 @@ int main(int argc, char** argv)
     std::printf("%-40s %10s %12s %12s\n", "operation", "rows", "median us", "p99 us");
     std::mt19937 random(1);
     for (unsigned rows : {100u, 1000u, 10000u}) {
+        if (rows > largest && rows != 100)
+            break;
         uint32_t component = dmisp::installText(tableMif(rows), "bench.mif", &error);
         if (component == 0) {
             std::fprintf(stderr, "%s\n", error.c_str());

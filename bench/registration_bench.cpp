@@ -1,6 +1,7 @@
 // Start-up registration against provider databases of 1, 20 and 100
 // components: wall time of RegisterWithSL and the DMI commands it issued.
-// Plain timed driver; prints one table.
+// Plain timed driver; prints one table. It registers as the daemon does.
+//   registration_bench [largest database (100 components)] [repeats (5)]
 #include <algorithm>
 #include <chrono>
 #include <cstdio>
@@ -8,7 +9,9 @@
 #include <filesystem>
 #include <string>
 #include <unistd.h>
+#include <vector>
 
+#include "daemon/startup.h"
 #include "dmisp/dmisp.h"
 #include "mif/mif.h"
 #include "sl/sl.h"
@@ -50,17 +53,21 @@ double registerOnce(uint64_t* commands)
 
 } // namespace
 
-int main()
+int main(int argc, char** argv)
 {
+    const int largest = argc > 1 ? std::atoi(argv[1]) : 100;
+    const int repeats = std::max(1, argc > 2 ? std::atoi(argv[2]) : 5);
     SLInitialize();
+    RegisterWithSLCalls(daemonRegistrationCalls());
     setenv("UXDMIPATH", MOX_SOURCE_DIR "/mifs", 1);
     char pattern[] = "/tmp/moxbenchXXXXXX";
     if (mkdtemp(pattern) == nullptr)
         return 1;
     std::string dir = pattern;
-    const int repeats = 5;
     printf("%-11s %-26s %12s %12s %10s\n", "components", "start", "median ms", "min ms", "commands");
     for (int count : {1, 20, 100}) {
+        if (count > largest && count != 1)
+            break;
         std::string db = dir + "/db" + std::to_string(count);
         std::string error;
         if (dmisp::reset(db, false, &error) != 0) {
@@ -80,11 +87,11 @@ int main()
         printf("%-11d %-26s %12.2f %12.2f %10llu\n", count, "first (installs mox.mif)", first, first,
                static_cast<unsigned long long>(firstCommands));
 
-        double times[repeats];
+        std::vector<double> times(static_cast<size_t>(repeats));
         uint64_t commands = 0;
         for (double& t : times)
             t = registerOnce(&commands);
-        std::sort(times, times + repeats);
+        std::sort(times.begin(), times.end());
         printf("%-11d %-26s %12.2f %12.2f %10llu\n", count, "later (own MIF current)", times[repeats / 2], times[0],
                static_cast<unsigned long long>(commands));
     }

@@ -37,7 +37,9 @@ for n in 1 20 100; do
   row "start-up registration, $n components (installs own MIF)" "$(registration "$out/registration.txt" $n first)" "ms"
 done
 row "heap per queued event" "$(figure "$out/events.txt" 'heap bytes per queued event')" "bytes"
-row "resident memory after 10,000 events, queue drained" "$(figure "$out/events.txt" 'after 10,000 events')" "KiB"
-row "resident memory after 100,000 events, queue drained" "$(figure "$out/events.txt" 'after 100000 events')" "KiB"
+row "resident memory after 10,000 events, queue drained" "$(figure "$out/events.txt" 'resident KiB after 10,000')" "KiB"
+row "resident memory after 100,000 events, queue drained" "$(figure "$out/events.txt" 'resident KiB after 100000 events')" "KiB"
+row "heap in use after 10,000 events, queue drained" "$(figure "$out/events.txt" 'heap bytes in use after 10,000')" "bytes"
+row "heap in use after 100,000 events, queue drained" "$(figure "$out/events.txt" 'heap bytes in use after 100000')" "bytes"
 row "idle event-to-log latency, median (200 events, 200 ms apart)" "$(figure "$out/events.txt" 'latency median')" "ms"
 row "idle event-to-log latency, p99" "$(figure "$out/events.txt" 'latency p99')" "ms"

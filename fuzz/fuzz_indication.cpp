@@ -4,6 +4,7 @@
 // the worker's classification and both matchers' record building, with a
 // provider that refuses every command, so only the indication is read.
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <cstdlib>
 #include <sched.h>
@@ -62,8 +63,10 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
     completed.store(0);
     unsigned before = EventsHandled();
     SLIndicationFunc(indication.data());
+    // Every indication is completed: one that is not is a fault, not a wait for ever.
+    const auto until = std::chrono::steady_clock::now() + std::chrono::seconds(30);
     while (completed.load() == 0)
-        sched_yield();
+        std::chrono::steady_clock::now() < until ? sched_yield() : (abort(), 0);
     if (EventsHandled() != before + 1)
         abort(); // every delivered indication is classified exactly once
     buildCatalogue(); // an installed component may have grown it

@@ -2,11 +2,15 @@
 // a mail body. The reply arrives on a socket in the pieces the first byte
 // chooses and is read by GetResponse; the list is split into recipients; the
 // body is built into the data, which must never carry a bare control byte.
+// The reply is written from a thread of its own: written first, a reply in
+// one-byte pieces would fill the socket buffer and wait for ever on a reader
+// that never starts; the reader closing its end releases the writer.
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
 #include <string>
 #include <sys/socket.h>
+#include <thread>
 #include <unistd.h>
 
 #include "smtp/smtp.h"
@@ -19,12 +23,16 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
     if (size > 4096 || socketpair(AF_UNIX, SOCK_STREAM, 0, pair) != 0)
         return 0;
     size_t piece = size == 0 ? 1 : (data[0] % 64) + 1;
-    for (size_t at = 0; at < size; at += piece)
-        send(pair[1], data + at, size - at < piece ? size - at : piece, MSG_NOSIGNAL);
-    shutdown(pair[1], SHUT_WR);
+    std::thread writer([&] {
+        for (size_t at = 0; at < size; at += piece)
+            if (send(pair[1], data + at, size - at < piece ? size - at : piece, MSG_NOSIGNAL) < 0)
+                break;
+        shutdown(pair[1], SHUT_WR);
+    });
     char reply[1024];
     int length = GetResponse(pair[0], reply, sizeof reply);
     close(pair[0]);
+    writer.join();
     close(pair[1]);
     if (length < 0 || length > 1023 || strlen(reply) != static_cast<size_t>(length))
         abort();

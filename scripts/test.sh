@@ -16,4 +16,4 @@ echo "== AddressSanitizer + UndefinedBehaviorSanitizer build"
 cmake -S . -B build-asan -DCMAKE_BUILD_TYPE=Debug -DMOX_SANITIZE=ON >/dev/null
 cmake --build build-asan -j"$jobs"
 (cd build-asan && ASAN_OPTIONS=detect_leaks=0:abort_on_error=1 UBSAN_OPTIONS=print_stacktrace=1 \
-  ctest -j"$jobs" -L "unit|e2e" --output-on-failure)
+  ctest -j"$jobs" -L "unit|e2e|fuzz" --output-on-failure)

@@ -93,12 +93,17 @@ void findBaseboardGroups()
     LcdInitialize();
 }
 
+RegistrationCalls daemonRegistrationCalls()
+{
+    return RegistrationCalls{EventHandler, findBaseboardGroups};
+}
+
 int init_routine(void)
 {
     MoxOsSpecificInit();
     ProcessCfgOption();
     SLInitialize();
-    RegisterWithSLCalls(RegistrationCalls{EventHandler, findBaseboardGroups});
+    RegisterWithSLCalls(daemonRegistrationCalls());
     moxNotify("STATUS=Registering with the DMI service provider");
     int rc = RegisterWithSL();
     if (rc == 0) {

@@ -3,11 +3,17 @@
 
 #include <cstdio>
 
+#include "mif/mif.h"
+
 // The process entry's work; never returns.
 [[noreturn]] void moxMain();
 // 4: a marker file disables the daemon; 0: start-up proceeds.
 int check_for_moxnot(void);
 void* mainThread(void* unused);
+// What the daemon registers with: its indication handler, and the search for
+// the baseboard's groups that ends a registration. Whatever registers as the
+// daemon does (init_routine, the benchmarks) passes it to RegisterWithSLCalls.
+RegistrationCalls daemonRegistrationCalls();
 // 0, or the non-zero result of RegisterWithSL.
 int init_routine(void);
 int unload(void);

@@ -573,6 +573,10 @@ void RegisterWithSLCalls(const RegistrationCalls& calls)
 
 int RegisterWithSL(void)
 {
+    // A registration without an indication handler would take every event
+    // and drop it without a word: it is refused before anything is sent.
+    if (registrationCalls.indicationHandler == nullptr)
+        return 2;
     myHandle = SLCreateHandle(0);
     if (myHandle == nullptr)
         return 1;

@@ -90,7 +90,8 @@ struct RegistrationCalls {
     void (*findBaseboardGroups)(void);
 };
 void RegisterWithSLCalls(const RegistrationCalls& calls);
-// 0 on success; 1 no SL handle, 2 registration refused, 3 own MIF unavailable.
+// 0 on success; 1 no SL handle, 2 registration refused (also when no
+// indication handler was given), 3 own MIF unavailable.
 int RegisterWithSL(void);
 void UnregisterWithSL(void);
 // Catalogues the installed own MIF and the supported components, installing

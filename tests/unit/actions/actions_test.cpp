@@ -1,10 +1,12 @@
 #include <gtest/gtest.h>
 
+#include <chrono>
 #include <fstream>
 #include <sys/wait.h>
 #include <syslog.h>
 #include <unistd.h>
 
+#include "actions/actionlog.h"
 #include "actions/actions.h"
 #include "actions/uxaction.h"
 #include "base/log.h"
@@ -104,25 +106,29 @@ TEST(OsServices, CaseInsensitiveComparisons)
             << (r.a ? r.a : "null") << " / " << (r.b ? r.b : "null") << " n=" << r.n;
 }
 
+// The action log's option follows the same rule; neither option switches the other.
 TEST(OsServices, NotificationOnlyRule)
 {
-    struct Row { std::string content; uint32_t before, after; } rows[] = {
+    struct Row { std::string content; uint32_t before, after, actionLog = 0; } rows[] = {
         {"NotificationOnly = TRUE\n", 0, 1}, {"notificationonly=false\n", 1, 0}, {"other = true\n", 0, 0},
         {"# notificationonly = true\n", 0, 0}, {"   # notificationonly = true\n", 0, 1}, // '#' only in column 1
         {"notificationonly = true\nnotificationonly = false\n", 0, 0}, {"notificationonly = false\nother\n", 1, 0},
         {std::string(490, 'x') + "notificationonly = true\n", 0, 0}, // split over two pieces
         {std::string(600, 'y') + " notificationonly true\n", 0, 1},
+        {"notificationonly = true\nActionLog = TRUE\nnotificationonly = off\n", 0, 0, 1},
+        {"actionlog = true\nactionlog = no\nnotificationonly = true\n", 0, 1, 0}, {"#actionlog = true\n", 0, 0, 0},
     };
     const std::string path = "/tmp/moxcfg" + std::to_string(getpid());
     for (const Row& row : rows) {
         std::ofstream(path) << row.content;
-        bNotificationOnly = row.before;
+        bNotificationOnly = row.before, bActionLog = 0;
         EXPECT_EQ(processCfgFile(path.c_str()), 1);
-        EXPECT_EQ(bNotificationOnly, row.after) << row.content;
+        EXPECT_EQ(std::make_pair(bNotificationOnly, bActionLog), std::make_pair(row.after, row.actionLog))
+            << row.content;
     }
     unlink(path.c_str());
     EXPECT_EQ(processCfgFile(path.c_str()), 0);
-    bNotificationOnly = 0;
+    bNotificationOnly = bActionLog = 0;
 }
 
 TEST(OsServices, DelaySleepsWholeSecondsAtLeastOne)
@@ -132,6 +138,9 @@ TEST(OsServices, DelaySleepsWholeSecondsAtLeastOne)
         MoxDelay(ms);
     moxSetSleepHook(nullptr);
     EXPECT_EQ(sleeps, (std::vector<unsigned>{3000, 2000, 1000, 1000, 1000, 40000}));
+    const auto start = std::chrono::steady_clock::now(); // a real sleep keeps its sub-second part
+    moxSleepMs(50);
+    EXPECT_GE(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(50));
 }
 
 TEST(OsServices, ShutdownExecutesInitZeroWithNoBlockedSignals)

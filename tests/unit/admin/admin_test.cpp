@@ -1,40 +1,18 @@
 #include <gtest/gtest.h>
 
 #include <cstddef>
-#include <fstream>
 #include <string>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <unistd.h>
 
 #include "actions/actionlog.h"
-#include "actions/uxaction.h"
 #include "base/log.h"
 #include "daemon/notify.h"
 
 namespace {
 
 std::string logged;
-
-// The action log follows the rule of the one documented option (comments in
-// column 1 only, the last line wins); neither option switches the other.
-TEST(Admin, ActionLogOption)
-{
-    struct Case { const char* content; uint32_t notificationOnly, actionLog; } cases[] = {
-        {"notificationonly = true\nActionLog = TRUE\nnotificationonly = off\n", 0, 1},
-        {"actionlog = true\nactionlog = no\nnotificationonly = true\n", 1, 0},
-        {"#actionlog = true\n", 0, 0}};
-    const std::string path = "/tmp/moxadmin" + std::to_string(getpid());
-    for (const Case& c : cases) {
-        std::ofstream(path) << c.content;
-        bNotificationOnly = bActionLog = 0;
-        EXPECT_EQ(processCfgFile(path.c_str()), 1);
-        EXPECT_EQ(bNotificationOnly, c.notificationOnly) << c.content;
-        EXPECT_EQ(bActionLog, c.actionLog) << c.content;
-    }
-    unlink(path.c_str());
-    bNotificationOnly = bActionLog = 0;
-}
 
 // One datagram per message to an abstract address; nothing without the variable.
 TEST(Admin, NotifySocket)

@@ -6,6 +6,7 @@
 #include <future>
 #include <sys/stat.h>
 #include <sys/wait.h>
+#include <syslog.h>
 #include <unistd.h>
 
 #include "actions/actions.h"
@@ -106,6 +107,24 @@ TEST_F(Events, StandardAndVendorRowSelectionAndRowsClaimingTooManyAttributes)
     }
     EXPECT_EQ(lastRecord.eventKind, 2u);
     EXPECT_EQ(lastRecord.errorState, 2u);
+    // The vendor line's priority follows the error value (the baseboard's one row serves every
+    // value); a group that cannot be listed gets no broadcast, and the line still comes.
+    OwnMif v;
+    v.vendor = {vendorRow(anyBoth, {9, 16})};
+    start(v);
+    actionsSetHandlers(nullptr);
+    for (auto [error, priority] :
+         {std::pair{0, LOG_INFO}, {1, LOG_WARNING}, {2, LOG_ERR}, {3, LOG_ERR}, {-1, LOG_ERR}}) {
+        SLDmiInvoke = error >= 0 ? SLInvokeFunction(DmiInvoke) : [](void* b) -> uint32_t { // group listings refused
+            return loadWordAt(b, 1) == 516 ? 1 : DmiInvoke(b);
+        };
+        ASSERT_EQ(dmisp::setValue(component[1], 30, 1, {}, std::to_string(error < 0 ? 2 : error)), 0u);
+        lines(), raise(1, 1);
+        std::vector<int> priorities;
+        for (const auto& line : lines())
+            priorities.push_back(line.first);
+        EXPECT_EQ(priorities, (error < 0 ? std::vector{priority} : std::vector{priority, LOG_EMERG})) << error;
+    }
     // Rows read after attribute 6 of nine attributes: only nine entries run.
     OwnMif m;
     m.actions = 6;

@@ -12,6 +12,12 @@ int shutDowns = 0;
 
 TEST_F(SystemControl, ActionCodes)
 {
+    // The capability report, before anything changes the word, asks the controller nothing.
+    SystemControlInfo info{};
+    EXPECT_EQ(MoxGetSystemControlInfo(&info), 0);
+    EXPECT_EQ((std::vector<uint32_t>{info.capabilities, info.minimumDelay, info.maximumDelay}),
+              (std::vector<uint32_t>{0x7FF, 100, 6553600}));
+    EXPECT_TRUE(obxsimLog().empty());
     const std::string armed = "watchdog set: use 0x04 action ", started = " countdown 1; watchdog started: countdown 1; ";
     enum { none, armingRefused, codeRefused };
     // bit: the capability it needs (without it, unsupported and nothing done); effect: what the controller saw.
@@ -65,6 +71,15 @@ TEST_F(SystemControl, WatchdogCountdown)
         EXPECT_EQ(MoxSetWatchDogTimeoutValue(row.timeoutAction, row.ms), row.data.empty() ? ObxResultError : ObxResultOk);
         std::vector<ObxSimRequest> sets = requestsFor(0x06, 0x24);
         EXPECT_EQ(sets.empty() ? std::vector<uint8_t>{} : sets[0].data, row.data) << row.ms;
+    }
+    // Mode 1 first arms no action with one step, then restarts; a refused first request ends it.
+    for (bool refused : {false, true}) {
+        SetUp();
+        if (refused)
+            obxsimInjectFault(ObxIoctlSendMessage, 0x06, 0x24, ObxSimCompletionCode, 0xC0);
+        EXPECT_EQ(MoxResetWatchDogTimer(1), refused ? ObxResultError : ObxResultOk);
+        EXPECT_EQ(requestsFor(0x06, 0x24).at(0).data, (std::vector<uint8_t>{0x04, 0x00, 0x00, 0x00, 0x01, 0x00}));
+        EXPECT_EQ(requestsFor(0x06, 0x22).size(), refused ? 0u : 1u);
     }
 }
 

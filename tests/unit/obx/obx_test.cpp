@@ -57,6 +57,26 @@ TEST_F(Obx, ControllerClassAndDriverFaults)
     size_t sent = obxsimRequests().size();
     EXPECT_EQ(SendTimedObxpRequest(&tooBig, 3, out.data(), &n, &cc), ObxResultError);
     EXPECT_EQ(obxsimRequests().size(), sent);
+    // A positive ioctl result is a failure too.
+    obxsimInjectFault(ObxIoctlSetShutdownCode, -1, -1, ObxSimPositive);
+    EXPECT_EQ(SetShutDownCode(1, 1), ObxResultError);
+
+    // Opening fails: no device (the perror line), or Get Device ID refused (its
+    // line; the device is closed again and opened anew on the next request).
+    SetUp();
+    obxsimSetDeviceMissing(true);
+    testing::internal::CaptureStderr();
+    EXPECT_EQ(open_obx(), 0);
+    EXPECT_EQ(testing::internal::GetCapturedStderr(),
+              "obxapi open_obx: open(/dev/obx) failed\n: No such file or directory\n");
+    SetUp();
+    obxsimInjectFault(ObxIoctlSendMessage, 0x06, 0x01, ObxSimCompletionCode, 0xC1, 1);
+    testing::internal::CaptureStdout();
+    EXPECT_EQ(SetShutDownCode(1, 1), ObxResultError);
+    EXPECT_EQ(testing::internal::GetCapturedStdout(), "open_obx: SendTimedObxpRequest error. Ret = 0 CC = 0xC1\n");
+    EXPECT_TRUE(hDevice1 == 0 && logged("close /dev/obx")) << actions();
+    EXPECT_EQ(SetShutDownCode(1, 1), ObxResultOk);
+    EXPECT_EQ(obxsimOpenCount(), 2);
 }
 
 TEST_F(Obx, MessageResponses)

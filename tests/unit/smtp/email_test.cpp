@@ -17,8 +17,8 @@ TEST_F(Provider, FromTheBaseboardSettingsAsTheServerReceivesIt)
     ASSERT_EQ(moxHostName(host), 0);
     smtpSetLimitMs(300); // the server says nothing after the subject line
     moxSetSleepHook([](unsigned) {});
-    // The defaults (sender admin@host, the event type) are the end-to-end scenario's; here
-    // the settings: a non-ASCII sender, two recipients, a group name carrying a line feed.
+    // The settings: a non-ASCII sender, two recipients, a group name carrying a line feed; then
+    // the default sender and recipient.
     ASSERT_EQ(dmisp::setValue(board, 1012, 1, {}, "127.0.0.1"), 0u);
     dmisp::setValue(board, 1012, 2, {}, "ops\xe9@example.org");
     dmisp::setValue(board, 1012, 3, {}, "a@example.org;b@example.org");
@@ -39,6 +39,14 @@ TEST_F(Provider, FromTheBaseboardSettingsAsTheServerReceivesIt)
                                    "Baseboard\r\nGroup:Fan  RSET\r\nInstance:Unknown\r\n.\r\nQUIT\r\n");
     EXPECT_EQ(pEmailConfig, nullptr);
     EXPECT_TRUE(lines().empty()) << "a delivered alert logs nothing";
+    // Sender and recipients not set: both are admin at this host.
+    dmisp::setValue(board, 1012, 2, {}, ""), dmisp::setValue(board, 1012, 3, {}, "");
+    ScriptedServer defaults(acceptingScript(1));
+    smtpSetPort(defaults.port());
+    MoxSendEmail(nullptr, &record);
+    const std::string admin = "admin@" + std::string(host);
+    EXPECT_NE(defaults.received().find("MAIL FROM:<" + admin + ">\r\nRCPT TO:<" + admin + ">\r\nDATA"),
+              std::string::npos);
     // Without a server address nothing is sent or logged.
     dmisp::setValue(board, 1012, 1, {}, "");
     smtpSetPort(1);

@@ -87,7 +87,7 @@ std::string boardMif(const std::string& name)
                  {"1, \"CPU Core\", 1", "2, \"3.3V\", 0", "7, \"\", 0"}) +
            table(5, "Zorek|Fan|001", "1", integers(1, 2), {"4, 1200"}) +
            "start group\n name = \"Board Errors\"\n class = \"Zorek|Error|001\"\n id = 30\n" +
-           attribute(1, "start enum\n 0 = \"OK\"\n 1 = \"Warning\"\n 2 = \"Failed\"\n end enum", "2") +
+           attribute(1, "start enum\n 0 = \"OK\"\n 1 = \"Warning\"\n 2 = \"Failed\"\n 3 = \"Lost\"\n end enum", "2") +
            "end group\nend component\n";
 }
 
